@@ -1,0 +1,30 @@
+// Facts about the running process and its threads, and how it ends when it must.
+#pragma once
+
+#include <string>
+#include <string_view>
+#include <vector>
+
+namespace kestrel::platform {
+
+// The calling thread's name; empty when it has none.
+std::string currentThreadName();
+void setCurrentThreadName(std::string_view name);
+
+// The call stack of the calling thread, one symbolised frame per entry.
+std::vector<std::string> currentCallStackSymbols();
+
+// Leaves the message for whoever examines the crash (standard error, which the
+// service manager keeps in its journal) and aborts the process.
+[[noreturn]] void abortWithCrashMessage(std::string_view message);
+
+}  // namespace kestrel::platform
+
+namespace kestrel::platform {
+
+// Tells the service manager, when there is one, that the daemon is ready to
+// serve (READY=1), or that it is stopping (STOPPING=1).
+void notifyServiceManagerReady();
+void notifyServiceManagerStopping();
+
+}  // namespace kestrel::platform

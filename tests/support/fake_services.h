@@ -1,0 +1,42 @@
+// A scratch root with every platform service faked and installed for the
+// test's process; the log is closed and the services removed again at the end.
+#pragma once
+
+#include <memory>
+
+#include "platform/fake/fake_code_signing_identity.h"
+#include "platform/fake/fake_logging.h"
+#include "platform/fake/fake_message_ipc.h"
+#include "platform/fake/fake_platform.h"
+#include "platform/fake/fake_sandbox.h"
+#include "platform/fake/fake_upcall_channel.h"
+#include "platform/services.h"
+#include "support/scratch_root.h"
+
+namespace kestrel::testing {
+
+class FakeServices {
+ public:
+  FakeServices();
+  ~FakeServices();
+  FakeServices(const FakeServices&) = delete;
+  FakeServices& operator=(const FakeServices&) = delete;
+
+  // Installs the current set again, after a test replaced one of them.
+  void install();
+
+  ScratchRoot scratch;
+  platform::Services services;
+  std::shared_ptr<platform::FakeAccounts> accounts;
+  std::shared_ptr<platform::FakeLogging> logging;
+  std::shared_ptr<platform::FakeDeviceInfo> deviceInfo;
+  std::shared_ptr<platform::FakeKeepAlive> keepAlive;
+  std::shared_ptr<platform::FakeNamedSemaphores> semaphores;
+  std::shared_ptr<platform::FakeKeyBag> keyBag;
+  std::shared_ptr<platform::FakeUpcallChannel> upcall;
+  std::shared_ptr<platform::FakeMessageIPC> messageIPC;
+  std::shared_ptr<platform::FakeSandbox> sandbox;
+  std::shared_ptr<platform::FakeCodeSigningIdentity> codeSigningIdentity;
+};
+
+}  // namespace kestrel::testing
