@@ -1,0 +1,181 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <chrono>
+#include <condition_variable>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/fake/fake_platform.h"
+#include "platform/linux/key_bag_linux.h"
+#include "support/scratch_root.h"
+
+namespace kestrel::platform {
+namespace {
+
+using namespace std::chrono_literals;
+using testing::ScratchRoot;
+
+constexpr const char* kLockState = "/run/kestrel/lock-state";
+constexpr const char* kMultiUser = "/etc/kestrel/multi-user";
+
+TEST(KeyBagTest, LockStateIsParsedFromTheLockStateFile) {
+  struct Row {
+    const char* content;  // nullptr: no file
+    int expected;
+  };
+  const Row rows[] = {
+      {nullptr, KeyBag::kUnlocked},
+      {"0", KeyBag::kUnlocked},
+      {"0\n", KeyBag::kUnlocked},
+      {"1", KeyBag::kLocked},
+      {"1\n", KeyBag::kLocked},
+      {"3\n", 3},
+      {"", -1},
+      {"\n", -1},
+      {"locked", -1},
+      {"1 0", -1},
+      {"1x", -1},
+      {"99999999999", -1},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.content != nullptr ? "\"" + std::string(row.content) + "\"" : "no file");
+    ScratchRoot scratch;
+    if (row.content != nullptr) scratch.writeFile(kLockState, row.content);
+    EXPECT_EQ(LinuxKeyBag(scratch.root()).lockState(), row.expected);
+  }
+}
+
+// Records what the handler saw, each time it runs.
+struct Observations {
+  std::mutex mutex;
+  std::condition_variable changed;
+  std::vector<int> states;
+  bool allOnQueue = true;
+
+  bool waitFor(int state, std::size_t from) {
+    std::unique_lock lock(mutex);
+    return changed.wait_for(lock, 10s, [&] {
+      for (std::size_t i = from; i < states.size(); ++i) {
+        if (states[i] == state) return true;
+      }
+      return false;
+    });
+  }
+  std::size_t count() {
+    std::lock_guard lock(mutex);
+    return states.size();
+  }
+};
+
+TEST(KeyBagTest, WritingTheLockStateRunsTheHandlerOnTheGivenQueue) {
+  ScratchRoot scratch;
+  const auto queue = DispatchQueue::createSerial("key-bag-test");
+  ASSERT_NE(queue, nullptr);
+  Observations seen;  // outlives the key bag, whose handler writes to it
+  LinuxKeyBag keyBag(scratch.root());
+  ASSERT_EQ(keyBag.registerLockStatusNotification(queue,
+                                                  [&] {
+                                                    const int state = keyBag.lockState();
+                                                    std::lock_guard lock(seen.mutex);
+                                                    seen.allOnQueue &= queue->isCurrent();
+                                                    seen.states.push_back(state);
+                                                    seen.changed.notify_all();
+                                                  }),
+            0);
+
+  struct stat st {};
+  ASSERT_EQ(::stat(scratch.resolve("/run/kestrel").c_str(), &st), 0);
+  EXPECT_TRUE(S_ISDIR(st.st_mode));
+  EXPECT_EQ(st.st_mode & 07777, 0755U);
+
+  scratch.writeFile(kLockState, "1");
+  ASSERT_TRUE(seen.waitFor(KeyBag::kLocked, 0));
+  const std::size_t afterLock = seen.count();
+  scratch.writeFile(kLockState, "0");
+  ASSERT_TRUE(seen.waitFor(KeyBag::kUnlocked, afterLock));
+  queue->sync([] {});
+  std::lock_guard lock(seen.mutex);
+  EXPECT_TRUE(seen.allOnQueue);
+}
+
+TEST(KeyBagTest, RegistrationFailsWithAnErrnoWhenTheStateDirectoryCannotBeMade) {
+  ScratchRoot scratch;
+  scratch.writeFile("/run", "not a directory");
+  LinuxKeyBag keyBag(scratch.root());
+  EXPECT_EQ(keyBag.registerLockStatusNotification(DispatchQueue::createSerial("q"), [] {}),
+            ENOTDIR);
+}
+
+TEST(KeyBagTest, TheMultiUserFileSetsTheModeAndListsTheSessions) {
+  struct Row {
+    const char* content;
+    std::optional<std::vector<std::uint32_t>> expected;  // nullopt: an error naming the file
+  };
+  const Row rows[] = {
+      {"501\n", std::vector<std::uint32_t>{501}},
+      {"501 502\n503\t504\n\n", std::vector<std::uint32_t>{501, 502, 503, 504}},
+      {"  4294967295  ", std::vector<std::uint32_t>{4294967295U}},
+      {"", std::vector<std::uint32_t>{}},
+      {"\n \n", std::vector<std::uint32_t>{}},
+      {"501 abc", std::nullopt},
+      {"-1", std::nullopt},
+      {"+501", std::nullopt},
+      {"4294967296", std::nullopt},
+      {"501,502", std::nullopt},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE("\"" + std::string(row.content) + "\"");
+    ScratchRoot scratch;
+    scratch.writeFile(kMultiUser, row.content);
+    LinuxKeyBag keyBag(scratch.root());
+    ASSERT_TRUE(keyBag.userTypeInfo().has_value());
+    EXPECT_EQ(keyBag.userTypeInfo()->deviceMode, DeviceMode::MultiUser);
+    std::string error;
+    EXPECT_EQ(keyBag.userSessionIds(&error), row.expected);
+    if (!row.expected) {
+      EXPECT_NE(error.find(scratch.resolve(kMultiUser)), std::string::npos) << error;
+    }
+  }
+}
+
+TEST(KeyBagTest, WithoutTheMultiUserFileTheDeviceIsSingleUser) {
+  ScratchRoot scratch;
+  LinuxKeyBag keyBag(scratch.root());
+  ASSERT_TRUE(keyBag.userTypeInfo().has_value());
+  EXPECT_EQ(keyBag.userTypeInfo()->deviceMode, DeviceMode::SingleUser);
+  std::string error;
+  EXPECT_FALSE(keyBag.userSessionIds(&error).has_value());
+  EXPECT_FALSE(error.empty());
+}
+
+TEST(KeyBagTest, TheFakePostsItsHandlersToTheirQueuesUnlessRegistrationFails) {
+  FakeKeyBag keyBag;
+  const auto queue = DispatchQueue::createSerial("fake-key-bag-test");
+  keyBag.setRegistrationStatus(EIO);
+  EXPECT_EQ(keyBag.registerLockStatusNotification(queue, [] {}), EIO);
+  EXPECT_EQ(keyBag.registrationCount(), 0U);
+
+  keyBag.setRegistrationStatus(0);
+  std::mutex mutex;
+  std::condition_variable ran;
+  bool done = false;
+  bool onQueue = false;
+  ASSERT_EQ(keyBag.registerLockStatusNotification(queue,
+                                                  [&] {
+                                                    std::lock_guard lock(mutex);
+                                                    onQueue = queue->isCurrent();
+                                                    done = true;
+                                                    ran.notify_all();
+                                                  }),
+            0);
+  EXPECT_EQ(keyBag.registeredQueue(), queue);
+  keyBag.notifyLockStatusChanged();
+  std::unique_lock lock(mutex);
+  ASSERT_TRUE(ran.wait_for(lock, 10s, [&] { return done; }));
+  EXPECT_TRUE(onQueue);
+}
+
+}  // namespace
+}  // namespace kestrel::platform
