@@ -1,0 +1,421 @@
+#include "daemon/locks.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <chrono>
+#include <functional>
+#include <future>
+#include <memory>
+#include <random>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "daemon/log.h"
+#include "support/fake_services.h"
+
+namespace kestrel {
+namespace {
+
+using namespace std::chrono_literals;
+
+// Long enough for a thread that could get a lock to have got it; a thread that
+// is rightly blocked stays blocked however long we wait.
+constexpr auto kSettle = 100ms;
+constexpr auto kPatience = 10s;
+
+// Takes a lock on a thread of its own and holds it until release(). The body
+// takes the lock (through a guard) and calls hold() while holding it. A holder
+// that is still waiting when it is released is a failure, not a hang: its
+// thread is left behind, blocked, with the state it shares.
+class LockHolder {
+ public:
+  using Body = std::function<void(const std::function<void()>& hold)>;
+
+  explicit LockHolder(Body body) : state_(std::make_shared<State>()) {
+    thread_ = std::thread([state = state_, body = std::move(body)] {
+      body([&state] {
+        state->acquired.set_value();
+        state->releaseFuture.wait();
+      });
+    });
+  }
+  ~LockHolder() { release(); }
+  LockHolder(const LockHolder&) = delete;
+  LockHolder& operator=(const LockHolder&) = delete;
+
+  bool acquired() const { return state_->acquiredFuture.wait_for(0s) == std::future_status::ready; }
+  bool waitAcquired() const {
+    return state_->acquiredFuture.wait_for(kPatience) == std::future_status::ready;
+  }
+  void release() {
+    if (!thread_.joinable()) return;
+    state_->release.set_value();
+    if (waitAcquired()) {
+      thread_.join();
+    } else {
+      ADD_FAILURE() << "a lock holder was still waiting for its lock when released";
+      thread_.detach();
+    }
+  }
+
+ private:
+  struct State {
+    std::promise<void> acquired;
+    std::shared_future<void> acquiredFuture = acquired.get_future().share();
+    std::promise<void> release;
+    std::shared_future<void> releaseFuture = release.get_future().share();
+  };
+
+  std::shared_ptr<State> state_;
+  std::thread thread_;
+};
+
+LockHolder::Body identifierLock(std::string identifier, bool forWriting) {
+  return [identifier, forWriting](const std::function<void()>& hold) {
+    KSTIdentifierLockGuard guard(identifier, forWriting);
+    hold();
+  };
+}
+
+LockHolder::Body allIdentifiersLock(bool forWriting) {
+  return [forWriting](const std::function<void()>& hold) {
+    KSTAllIdentifiersLockGuard guard(forWriting);
+    hold();
+  };
+}
+
+class LocksConcurrencyTest : public ::testing::Test {
+ protected:
+  std::size_t countLines(std::string_view tag, std::string_view message) const {
+    std::size_t count = 0;
+    for (const auto& line : fakes.logging->lines()) {
+      if (line.tag == tag && line.message == message) ++count;
+    }
+    return count;
+  }
+
+  // Waits until a locker has announced that it waits (its counts are raised by then).
+  bool waitForLine(std::string_view tag, std::string_view message, std::size_t count = 1) const {
+    const auto deadline = std::chrono::steady_clock::now() + kPatience;
+    while (countLines(tag, message) < count) {
+      if (std::chrono::steady_clock::now() > deadline) return false;
+      std::this_thread::sleep_for(1ms);
+    }
+    return true;
+  }
+
+  std::vector<std::string> messagesTagged(std::string_view tag) const {
+    std::vector<std::string> messages;
+    for (const auto& line : fakes.logging->lines()) {
+      if (line.tag == tag) messages.push_back(line.message);
+    }
+    return messages;
+  }
+
+  testing::FakeServices fakes;
+};
+
+TEST_F(LocksConcurrencyTest, WriterWaitsForBothReadersAndTheRecordGoesWithTheLastRelease) {
+  LockHolder reader1(identifierLock("X", kKSTLockForReading));
+  LockHolder reader2(identifierLock("X", kKSTLockForReading));
+  ASSERT_TRUE(reader1.waitAcquired());
+  ASSERT_TRUE(reader2.waitAcquired());
+
+  LockHolder writer(identifierLock("X", kKSTLockForWriting));
+  ASSERT_TRUE(waitForLine("take_one_lock", "Waiting to lock X for writing"));
+  std::this_thread::sleep_for(kSettle);
+  EXPECT_FALSE(writer.acquired());
+  EXPECT_EQ(KSTLocksLiveRecordCount(), 1u);
+
+  reader1.release();
+  std::this_thread::sleep_for(kSettle);
+  EXPECT_FALSE(writer.acquired());
+
+  reader2.release();
+  ASSERT_TRUE(writer.waitAcquired());
+  EXPECT_EQ(countLines("unlock_one_lock", "Destroying lock for identifier X"), 0u);
+
+  writer.release();
+  EXPECT_EQ(KSTLocksLiveRecordCount(), 0u);
+  EXPECT_EQ(countLines("unlock_one_lock", "Unlocked identifier X"), 3u);
+  EXPECT_EQ(countLines("unlock_one_lock", "Destroying lock for identifier X"), 1u);
+}
+
+TEST_F(LocksConcurrencyTest, WaitingAllWriterDoesNotHoldBackNewReadersButAHeldOneDoes) {
+  LockHolder reader(identifierLock("X", kKSTLockForReading));
+  ASSERT_TRUE(reader.waitAcquired());
+
+  LockHolder allWriter(allIdentifiersLock(kKSTLockForWriting));
+  ASSERT_TRUE(waitForLine("_lock_all_identifiers", "Waiting to lock all identifiers for writing"));
+  std::this_thread::sleep_for(kSettle);
+  EXPECT_FALSE(allWriter.acquired());
+
+  // Readers arriving while the writer of all identifiers only waits get in.
+  {
+    LockHolder sameIdentifier(identifierLock("X", kKSTLockForReading));
+    LockHolder otherIdentifier(identifierLock("Y", kKSTLockForReading));
+    EXPECT_TRUE(sameIdentifier.waitAcquired());
+    EXPECT_TRUE(otherIdentifier.waitAcquired());
+  }
+  EXPECT_FALSE(allWriter.acquired());
+
+  reader.release();
+  ASSERT_TRUE(allWriter.waitAcquired());
+
+  // Once it holds the lock, identifier readers and writers and readers of all
+  // identifiers wait for it.
+  LockHolder lateReader(identifierLock("Z", kKSTLockForReading));
+  LockHolder lateWriter(identifierLock("W", kKSTLockForWriting));
+  LockHolder lateAllReader(allIdentifiersLock(kKSTLockForReading));
+  std::this_thread::sleep_for(kSettle);
+  EXPECT_FALSE(lateReader.acquired());
+  EXPECT_FALSE(lateWriter.acquired());
+  EXPECT_FALSE(lateAllReader.acquired());
+
+  allWriter.release();
+  EXPECT_TRUE(lateReader.waitAcquired());
+  // The identifier writer and the reader of all identifiers exclude each other:
+  // one gets in, then the other.
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  while (!lateWriter.acquired() && !lateAllReader.acquired() &&
+         std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(1ms);
+  }
+  const bool writerFirst = lateWriter.acquired();
+  LockHolder& firstIn = writerFirst ? lateWriter : lateAllReader;
+  LockHolder& secondIn = writerFirst ? lateAllReader : lateWriter;
+  ASSERT_TRUE(firstIn.acquired());
+  std::this_thread::sleep_for(kSettle);
+  EXPECT_FALSE(secondIn.acquired());
+  firstIn.release();
+  EXPECT_TRUE(secondIn.waitAcquired());
+}
+
+TEST_F(LocksConcurrencyTest, AllReadersShareWithIdentifierReadersButExcludeIdentifierWriters) {
+  LockHolder allReader1(allIdentifiersLock(kKSTLockForReading));
+  LockHolder allReader2(allIdentifiersLock(kKSTLockForReading));
+  ASSERT_TRUE(allReader1.waitAcquired());
+  ASSERT_TRUE(allReader2.waitAcquired());
+
+  LockHolder identifierReader(identifierLock("X", kKSTLockForReading));
+  EXPECT_TRUE(identifierReader.waitAcquired());
+
+  LockHolder identifierWriter(identifierLock("Y", kKSTLockForWriting));
+  LockHolder allWriter(allIdentifiersLock(kKSTLockForWriting));
+  std::this_thread::sleep_for(kSettle);
+  EXPECT_FALSE(identifierWriter.acquired());
+  EXPECT_FALSE(allWriter.acquired());
+
+  allReader1.release();
+  std::this_thread::sleep_for(kSettle);
+  EXPECT_FALSE(identifierWriter.acquired());
+
+  allReader2.release();
+  EXPECT_TRUE(identifierWriter.waitAcquired());
+  EXPECT_FALSE(allWriter.acquired());
+
+  identifierReader.release();
+  identifierWriter.release();
+  EXPECT_TRUE(allWriter.waitAcquired());
+}
+
+TEST_F(LocksConcurrencyTest, ArraysAreTakenAscendingAndReleasedDescendingEachIdentifierOnce) {
+  struct Row {
+    std::vector<std::string> identifiers;
+    std::vector<std::string> lockOrder;
+  } rows[] = {
+      {{"b", "a"}, {"a", "b"}}, {{"a", "b"}, {"a", "b"}}, {{"b", "a", "b", "a"}, {"a", "b"}},
+      {{"c", "c"}, {"c"}},      {{"a", "B"}, {"B", "a"}},  // by character value: upper case first
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(::testing::PrintToString(row.identifiers));
+    fakes.logging->clear();
+    KSTIdentifierLockGuard guard(row.identifiers, kKSTLockForReading);
+    EXPECT_EQ(KSTLocksLiveRecordCount(), row.lockOrder.size());
+
+    std::vector<std::string> expectedTaking;
+    for (const auto& identifier : row.lockOrder) {
+      expectedTaking.push_back("Waiting to lock " + identifier + " for reading");
+      expectedTaking.push_back("Got lock on identifier " + identifier);
+    }
+    EXPECT_EQ(messagesTagged("take_one_lock"), expectedTaking);
+
+    guard.unlock();
+    std::vector<std::string> expectedReleasing;
+    for (auto it = row.lockOrder.rbegin(); it != row.lockOrder.rend(); ++it) {
+      expectedReleasing.push_back("Unlocked identifier " + *it);
+      expectedReleasing.push_back("Destroying lock for identifier " + *it);
+    }
+    EXPECT_EQ(messagesTagged("unlock_one_lock"), expectedReleasing);
+    EXPECT_EQ(KSTLocksLiveRecordCount(), 0u);
+  }
+}
+
+// Two requests locking the same identifiers in opposite orders: both take the
+// smaller first, so while one holds it the other waits without holding anything.
+TEST_F(LocksConcurrencyTest, OppositeOrdersContendOnTheSmallestIdentifierFirst) {
+  LockHolder first([](const std::function<void()>& hold) {
+    KSTIdentifierLockGuard guard(std::vector<std::string>{"a", "b"}, kKSTLockForWriting);
+    hold();
+  });
+  ASSERT_TRUE(first.waitAcquired());
+
+  LockHolder second([](const std::function<void()>& hold) {
+    KSTIdentifierLockGuard guard(std::vector<std::string>{"b", "a"}, kKSTLockForWriting);
+    hold();
+  });
+  ASSERT_TRUE(waitForLine("take_one_lock", "Waiting to lock a for writing", 2));
+  std::this_thread::sleep_for(kSettle);
+  EXPECT_FALSE(second.acquired());
+  // The second request never got as far as "b".
+  EXPECT_EQ(countLines("take_one_lock", "Waiting to lock b for writing"), 1u);
+
+  first.release();
+  EXPECT_TRUE(second.waitAcquired());
+}
+
+// Many threads mixing every kind of lock; each holder checks, on entry and
+// again before it leaves, that nobody it excludes holds a lock at the same time.
+TEST_F(LocksConcurrencyTest, MixedLockersNeverOverlapWhereTheyExcludeEachOther) {
+  // Debug lines off: the check is about exclusion, not the log.
+  ASSERT_TRUE(Log::open("com.zorvane.kestreld", fakes.scratch.path() + "/log", kLogNotice));
+
+  constexpr int kThreads = 8;
+  constexpr int kIterations = 1500;
+  const std::array<std::string, 3> identifiers = {"A", "B", "C"};
+  std::array<std::atomic<int>, 3> identifierWriters{};
+  std::array<std::atomic<int>, 3> identifierReaders{};
+  std::atomic<int> allWriters{0};
+  std::atomic<int> allReaders{0};
+  std::atomic<int> violations{0};
+  std::atomic<int> allWriterEntries{0};
+
+  auto sum = [](const std::array<std::atomic<int>, 3>& counts) {
+    return counts[0].load() + counts[1].load() + counts[2].load();
+  };
+  auto expect = [&](bool ok) {
+    if (!ok) ++violations;
+  };
+  auto checkIdentifiers = [&](const std::vector<std::size_t>& held, bool forWriting) {
+    for (std::size_t k : held) {
+      if (forWriting) {
+        expect(identifierWriters[k] == 1 && identifierReaders[k] == 0);
+        expect(allWriters == 0 && allReaders == 0);
+      } else {
+        expect(identifierWriters[k] == 0 && allWriters == 0);
+      }
+    }
+  };
+  auto holdIdentifiers = [&](const std::vector<std::size_t>& picked, bool forWriting) {
+    std::vector<std::string> names;
+    for (std::size_t k : picked) names.push_back(identifiers[k]);
+    KSTIdentifierLockGuard guard(names, forWriting);
+    std::vector<std::size_t> held = picked;
+    std::sort(held.begin(), held.end());
+    held.erase(std::unique(held.begin(), held.end()), held.end());
+    auto& counts = forWriting ? identifierWriters : identifierReaders;
+    for (std::size_t k : held) ++counts[k];
+    checkIdentifiers(held, forWriting);
+    std::this_thread::yield();
+    checkIdentifiers(held, forWriting);
+    for (std::size_t k : held) --counts[k];
+  };
+  auto holdAll = [&](bool forWriting) {
+    KSTAllIdentifiersLockGuard guard(forWriting);
+    auto check = [&] {
+      if (forWriting) {
+        expect(allWriters == 1 && allReaders == 0);
+        expect(sum(identifierWriters) == 0 && sum(identifierReaders) == 0);
+      } else {
+        expect(allWriters == 0 && sum(identifierWriters) == 0);
+      }
+    };
+    if (forWriting) {
+      ++allWriters;
+      ++allWriterEntries;
+    } else {
+      ++allReaders;
+    }
+    check();
+    std::this_thread::yield();
+    check();
+    --(forWriting ? allWriters : allReaders);
+  };
+
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      std::mt19937 random(static_cast<unsigned>(t) * 7919u + 1u);
+      std::uniform_int_distribution<std::size_t> pickIdentifier(0, 2);
+      std::uniform_int_distribution<int> pickOperation(0, 9);
+      for (int i = 0; i < kIterations; ++i) {
+        const int operation = pickOperation(random);
+        const bool forWriting = operation % 2 == 0;
+        if (operation < 4) {
+          holdIdentifiers({pickIdentifier(random)}, forWriting);
+        } else if (operation < 8) {
+          holdIdentifiers({pickIdentifier(random), pickIdentifier(random), pickIdentifier(random)},
+                          forWriting);
+        } else {
+          holdAll(forWriting);
+        }
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+
+  EXPECT_EQ(violations.load(), 0);
+  EXPECT_GT(allWriterEntries.load(), 0);
+  EXPECT_EQ(KSTLocksLiveRecordCount(), 0u);
+  // Everything was released: a writer of all identifiers gets in at once.
+  KSTAllIdentifiersLockGuard all(kKSTLockForWriting);
+}
+
+using LocksDeathTest = ::testing::Test;
+
+TEST_F(LocksDeathTest, MisuseAbortsWithTheFailedCondition) {
+  GTEST_FLAG_SET(death_test_style, "threadsafe");
+  testing::FakeServices fakes;
+  struct Row {
+    const char* label;
+    std::function<void()> misuse;
+    const char* message;
+  } rows[] = {
+      {"identifier never locked in this process", [] { unlock_identifier("X"); },
+       "identifierToLockMap != nullptr"},
+      {"identifier not locked",
+       [] {
+         { KSTIdentifierLockGuard other("Y", kKSTLockForReading); }
+         unlock_identifier("X");
+       },
+       "found != map.end\\(\\)"},
+      {"identifier released twice",
+       [] {
+         _lock_identifier("X", kKSTLockForWriting);
+         unlock_identifier("X");
+         unlock_identifier(std::vector<std::string>{"X"});
+       },
+       "found != map.end\\(\\)"},
+      {"all identifiers not locked", [] { unlock_all_identifiers(); }, "allReaderWriterState > 0"},
+      {"number as identifier", [] { _lock_identifier(PlistValue(42), kKSTLockForReading); },
+       "Unknown parameter type!"},
+      {"dictionary released", [] { unlock_identifier(PlistValue(PlistDictionary{})); },
+       "Unknown parameter type!"},
+      {"array holding a number",
+       [] {
+         _lock_identifier(PlistValue(PlistArray{"a", 1}), kKSTLockForWriting);
+       },
+       "Unknown parameter type!"},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.label);
+    EXPECT_DEATH(row.misuse(), row.message);
+  }
+}
+
+}  // namespace
+}  // namespace kestrel
