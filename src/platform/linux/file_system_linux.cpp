@@ -1,0 +1,472 @@
+#include "platform/file_system.h"
+
+#include <acl/libacl.h>
+#include <attr/libattr.h>
+#include <fcntl.h>
+#include <fts.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/data_protection.h"
+#include "platform/unique_fd.h"
+
+namespace kestrel::platform {
+
+namespace {
+
+struct FtsCloser {
+  void operator()(FTS* fts) const { ::fts_close(fts); }
+};
+using FtsHandle = std::unique_ptr<FTS, FtsCloser>;
+
+// The errno of a library call that reported failure, never 0.
+int lastError() {
+  return errno != 0 ? errno : EIO;
+}
+
+FtsHandle openWalk(const char* path, int options) {
+  char* paths[] = {const_cast<char*>(path), nullptr};
+  return FtsHandle(::fts_open(paths, options, nullptr));
+}
+
+// --- Removal -------------------------------------------------------------------------------
+
+// The errno of removing one entry of the walk; 0 when it is gone or needs nothing yet.
+int removeEntry(const FTSENT* entry) {
+  switch (entry->fts_info) {
+    case FTS_D:
+      return 0;  // Removed after its contents (FTS_DP).
+    case FTS_DP:
+      return ::rmdir(entry->fts_accpath) == 0 ? 0 : errno;
+    case FTS_DNR:
+      // Its contents could not be listed; it goes only when it is empty.
+      if (::rmdir(entry->fts_accpath) == 0) return 0;
+      return entry->fts_errno != 0 ? entry->fts_errno : errno;
+    case FTS_ERR:
+    case FTS_NS:
+      return entry->fts_errno != 0 ? entry->fts_errno : EIO;
+    case FTS_DC:
+      return ELOOP;
+    default:  // Files, symbolic links (never followed) and special files.
+      return ::unlink(entry->fts_accpath) == 0 ? 0 : errno;
+  }
+}
+
+// --- Copy ----------------------------------------------------------------------------------
+
+// Extended attributes to copy: all but those that the ACL copy carries
+// (system.posix_acl_*), and but those /etc/xattr.conf says to skip, except
+// that trusted.* attributes (protection classes, extended ACL entries) are
+// always kept.
+int keepAttribute(const char* name, struct error_context* context) {
+  const int action = ::attr_copy_action(name, context);
+  if (action == ATTR_ACTION_PERMISSIONS) return 0;
+  if (std::strncmp(name, "trusted.", 8) == 0) return 1;
+  return action == ATTR_ACTION_SKIP ? 0 : 1;
+}
+
+// attr_copy_action() reads its configuration on first use without a lock.
+void loadAttributeActions() {
+  static std::once_flag once;
+  std::call_once(once, [] { ::attr_copy_action("user.", nullptr); });
+}
+
+std::string procPath(int fd) {
+  return "/proc/self/fd/" + std::to_string(fd);
+}
+
+// Where an entry of the copy goes: a name in an open destination directory, or
+// the destination path itself for the top entry.
+struct Place {
+  int directory = AT_FDCWD;
+  const char* name = nullptr;
+
+  // A path naming the same item without following a link at its last component.
+  std::string path() const {
+    return directory == AT_FDCWD ? std::string(name) : procPath(directory) + "/" + name;
+  }
+};
+
+int copyData(int in, int out) {
+  // In the kernel first (and sharing extents where the file system can).
+  for (;;) {
+    const ssize_t n = ::copy_file_range(in, nullptr, out, nullptr, std::size_t{1} << 30, 0);
+    if (n > 0) continue;
+    if (n == 0) return 0;
+    if (errno == EINTR) continue;
+    if (errno == EXDEV || errno == EINVAL || errno == ENOSYS || errno == EOPNOTSUPP) break;
+    return errno;
+  }
+  // Both offsets have moved past what was copied; go on from there.
+  std::vector<char> buffer(std::size_t{1} << 16);
+  for (;;) {
+    const ssize_t n = ::read(in, buffer.data(), buffer.size());
+    if (n == 0) return 0;
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return errno;
+    }
+    for (ssize_t done = 0; done < n;) {
+      const ssize_t w = ::write(out, buffer.data() + done, static_cast<std::size_t>(n - done));
+      if (w < 0) {
+        if (errno == EINTR) continue;
+        return errno;
+      }
+      done += w;
+    }
+  }
+}
+
+class TreeCopy {
+ public:
+  TreeCopy(const char* from, const char* to) : from_(from), to_(to) {}
+
+  int run() {
+    loadAttributeActions();
+    const FtsHandle walk = openWalk(from_, FTS_PHYSICAL | FTS_NOCHDIR);
+    if (!walk) return lastError();
+    errno = 0;
+    while (FTSENT* entry = ::fts_read(walk.get())) {
+      const int error = copyEntry(entry);
+      if (error != 0) return error;
+      errno = 0;
+    }
+    return errno;
+  }
+
+ private:
+  Place placeOf(const FTSENT* entry) const {
+    if (entry->fts_level == FTS_ROOTLEVEL) return Place{AT_FDCWD, to_};
+    return Place{directories_[static_cast<std::size_t>(entry->fts_level) - 1].get(),
+                 entry->fts_name};
+  }
+
+  int copyEntry(FTSENT* entry) {
+    switch (entry->fts_info) {
+      case FTS_D:
+        return enterDirectory(entry);
+      case FTS_DP:
+        return leaveDirectory(entry);
+      case FTS_F:
+        return copyRegularFile(entry);
+      case FTS_SL:
+      case FTS_SLNONE:
+        return copySymbolicLink(entry);
+      case FTS_DEFAULT:
+        return copySpecialFile(entry);
+      case FTS_DC:
+        return ELOOP;
+      default:  // FTS_DNR, FTS_ERR, FTS_NS
+        return entry->fts_errno != 0 ? entry->fts_errno : EIO;
+    }
+  }
+
+  int enterDirectory(const FTSENT* entry) {
+    const struct stat& st = *entry->fts_statp;
+    if (madeRoot_ && st.st_dev == rootDevice_ && st.st_ino == rootInode_) return EINVAL;
+    const Place place = placeOf(entry);
+    // Owner-only until its contents are in; the source's mode comes last.
+    if (::mkdirat(place.directory, place.name, S_IRWXU) != 0) return errno;
+    UniqueFd directory(
+        ::openat(place.directory, place.name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!directory) return errno;
+    if (entry->fts_level == FTS_ROOTLEVEL) {
+      struct stat made {};
+      if (::fstat(directory.get(), &made) != 0) return errno;
+      madeRoot_ = true;
+      rootDevice_ = made.st_dev;
+      rootInode_ = made.st_ino;
+    }
+    const auto level = static_cast<std::size_t>(entry->fts_level);
+    if (directories_.size() <= level) directories_.resize(level + 1);
+    directories_[level] = std::move(directory);
+    return 0;
+  }
+
+  int leaveDirectory(const FTSENT* entry) {
+    const auto level = static_cast<std::size_t>(entry->fts_level);
+    const UniqueFd destination = std::move(directories_[level]);
+    const UniqueFd source(
+        ::open(entry->fts_accpath, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!source) return errno;
+    struct stat st {};
+    if (::fstat(source.get(), &st) != 0) return errno;
+    if (::fchown(destination.get(), st.st_uid, st.st_gid) != 0) return errno;
+    if (::attr_copy_fd(entry->fts_path, source.get(), to_, destination.get(), keepAttribute,
+                       nullptr) != 0) {
+      return lastError();
+    }
+    // Access and default ACLs; the default ACL can only be reached by path.
+    if (::perm_copy_file(procPath(source.get()).c_str(), procPath(destination.get()).c_str(),
+                         nullptr) != 0) {
+      return lastError();
+    }
+    return finishWithModeAndTimes(destination.get(), st);
+  }
+
+  int copyRegularFile(const FTSENT* entry) {
+    const UniqueFd source(
+        ::open(entry->fts_accpath, O_RDONLY | O_NOFOLLOW | O_NOCTTY | O_NONBLOCK | O_CLOEXEC));
+    if (!source) return errno;
+    struct stat st {};
+    if (::fstat(source.get(), &st) != 0) return errno;
+    if (!S_ISREG(st.st_mode)) return EAGAIN;  // Replaced while we walked.
+    const Place place = placeOf(entry);
+    const UniqueFd destination(::openat(place.directory, place.name,
+                                        O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC,
+                                        S_IRUSR | S_IWUSR));
+    if (!destination) return errno;
+    if (const int error = copyData(source.get(), destination.get()); error != 0) return error;
+    if (::fchown(destination.get(), st.st_uid, st.st_gid) != 0) return errno;
+    const std::string destinationPath = place.path();
+    if (::attr_copy_fd(entry->fts_path, source.get(), destinationPath.c_str(), destination.get(),
+                       keepAttribute, nullptr) != 0 ||
+        ::perm_copy_fd(entry->fts_path, source.get(), destinationPath.c_str(), destination.get(),
+                       nullptr) != 0) {
+      return lastError();
+    }
+    return finishWithModeAndTimes(destination.get(), st);
+  }
+
+  int copySymbolicLink(const FTSENT* entry) {
+    const struct stat& st = *entry->fts_statp;
+    std::string target(static_cast<std::size_t>(st.st_size) + 1, '\0');
+    for (;;) {
+      const ssize_t n = ::readlink(entry->fts_accpath, target.data(), target.size());
+      if (n < 0) return errno;
+      if (static_cast<std::size_t>(n) < target.size()) {
+        target.resize(static_cast<std::size_t>(n));
+        break;
+      }
+      target.resize(target.size() * 2);  // The link grew since it was examined.
+    }
+    const Place place = placeOf(entry);
+    if (::symlinkat(target.c_str(), place.directory, place.name) != 0) return errno;
+    if (::fchownat(place.directory, place.name, st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW) != 0) {
+      return errno;
+    }
+    if (::attr_copy_file(entry->fts_accpath, place.path().c_str(), keepAttribute, nullptr) != 0) {
+      return lastError();
+    }
+    const struct timespec times[2] = {st.st_atim, st.st_mtim};
+    return ::utimensat(place.directory, place.name, times, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+  }
+
+  // FIFOs, sockets and device nodes: made anew, never opened.
+  int copySpecialFile(const FTSENT* entry) {
+    const struct stat& st = *entry->fts_statp;
+    const Place place = placeOf(entry);
+    if (::mknodat(place.directory, place.name, st.st_mode & (S_IFMT | 0700), st.st_rdev) != 0) {
+      return errno;
+    }
+    if (::fchownat(place.directory, place.name, st.st_uid, st.st_gid, AT_SYMLINK_NOFOLLOW) != 0) {
+      return errno;
+    }
+    const std::string destinationPath = place.path();
+    if (::attr_copy_file(entry->fts_accpath, destinationPath.c_str(), keepAttribute, nullptr) !=
+            0 ||
+        ::perm_copy_file(entry->fts_accpath, destinationPath.c_str(), nullptr) != 0) {
+      return lastError();
+    }
+    if (::fchmodat(place.directory, place.name, st.st_mode & 07777, 0) != 0) return errno;
+    const struct timespec times[2] = {st.st_atim, st.st_mtim};
+    return ::utimensat(place.directory, place.name, times, AT_SYMLINK_NOFOLLOW) == 0 ? 0 : errno;
+  }
+
+  // The mode last: changing the owner clears set-id bits, and a read-only
+  // directory must stay writable until its contents are in.
+  static int finishWithModeAndTimes(int fd, const struct stat& st) {
+    if (::fchmod(fd, st.st_mode & 07777) != 0) return errno;
+    const struct timespec times[2] = {st.st_atim, st.st_mtim};
+    return ::futimens(fd, times) == 0 ? 0 : errno;
+  }
+
+  const char* from_;
+  const char* to_;
+  // The open destination directory of each level of the walk.
+  std::vector<UniqueFd> directories_;
+  bool madeRoot_ = false;
+  dev_t rootDevice_ = 0;
+  ino_t rootInode_ = 0;
+};
+
+// --- Whole files ---------------------------------------------------------------------------
+
+int writeAll(int fd, std::span<const std::uint8_t> contents) {
+  std::size_t done = 0;
+  while (done < contents.size()) {
+    const ssize_t n = ::write(fd, contents.data() + done, contents.size() - done);
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return errno;
+    }
+    done += static_cast<std::size_t>(n);
+  }
+  return 0;
+}
+
+int writeInPlace(const char* path, std::span<const std::uint8_t> contents,
+                 const FileWriteOptions& options) {
+  const UniqueFd fd(
+      ::open(path, O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_CLOEXEC, options.mode));
+  if (!fd) return errno;
+  if (const int error = writeAll(fd.get(), contents); error != 0) return error;
+  if (options.protectionClass) {
+    return setProtectionClassOfNewFile(fd.get(), *options.protectionClass);
+  }
+  return 0;
+}
+
+int writeAtomically(const char* path, std::span<const std::uint8_t> contents,
+                    const FileWriteOptions& options) {
+  const std::string target(path);
+  const std::size_t slash = target.rfind('/');
+  const std::string directory = slash == std::string::npos ? "." : target.substr(0, slash + 1);
+  const std::string name = slash == std::string::npos ? target : target.substr(slash + 1);
+  if (name.empty()) return EISDIR;
+  // Hidden, so that directory listings never show a half-written file.
+  std::string temporary = directory + "." + name + ".XXXXXX";
+  const UniqueFd fd(::mkostemp(temporary.data(), O_CLOEXEC));
+  if (!fd) return errno;
+  // Removes the temporary file unless it became the target.
+  struct Remover {
+    const std::string& path;
+    bool armed = true;
+    ~Remover() {
+      if (armed) ::unlink(path.c_str());
+    }
+  } remover{temporary};
+
+  if (::fchmod(fd.get(), options.mode) != 0) return errno;
+  if (const int error = writeAll(fd.get(), contents); error != 0) return error;
+  if (options.protectionClass) {
+    if (const int error = setProtectionClassOfNewFile(fd.get(), *options.protectionClass);
+        error != 0) {
+      return error;
+    }
+  }
+  if (::fsync(fd.get()) != 0) return errno;
+  if (::rename(temporary.c_str(), path) != 0) return errno;
+  remover.armed = false;
+  // Make the rename itself durable; the new contents are in place either way.
+  const UniqueFd parent(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (parent) ::fsync(parent.get());
+  return 0;
+}
+
+}  // namespace
+
+int treeRemove(const char* path, const TreeRemoveErrorCallback& onItemError) {
+  struct stat st {};
+  if (::lstat(path, &st) != 0) return errno;
+  const FtsHandle walk = openWalk(path, FTS_PHYSICAL | FTS_NOCHDIR | FTS_XDEV);
+  if (!walk) return lastError();
+  errno = 0;
+  while (FTSENT* entry = ::fts_read(walk.get())) {
+    const int error = removeEntry(entry);
+    if (error != 0 && !(onItemError && onItemError(entry->fts_path, error))) return error;
+    errno = 0;
+  }
+  return errno;
+}
+
+int makePath(const char* path, mode_t mode) {
+  std::string target(path);
+  while (target.size() > 1 && target.back() == '/') target.pop_back();
+  if (target.empty()) return ENOENT;
+  if (::mkdir(target.c_str(), mode) == 0) return 0;
+  if (errno != ENOENT) return errno;
+  // A parent is missing: make every component from the top.
+  for (std::size_t slash = target.find('/', 1); slash != std::string::npos;
+       slash = target.find('/', slash + 1)) {
+    if (target[slash - 1] == '/') continue;
+    const std::string parent = target.substr(0, slash);
+    if (::mkdir(parent.c_str(), mode) == 0) continue;
+    if (errno != EEXIST) return errno;
+    struct stat st {};
+    if (::stat(parent.c_str(), &st) != 0) return errno;
+    if (!S_ISDIR(st.st_mode)) return ENOTDIR;
+  }
+  return ::mkdir(target.c_str(), mode) == 0 ? 0 : errno;
+}
+
+int copyTree(const char* from, const char* to) {
+  struct stat st {};
+  if (::lstat(from, &st) != 0) return errno;
+  return TreeCopy(from, to).run();
+}
+
+int lstatFileFlags(const char* path, std::uint32_t* flags) {
+  struct statx sx {};
+  if (::statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT, 0, &sx) != 0) return errno;
+  *flags = 0;
+  if ((sx.stx_attributes_mask & STATX_ATTR_IMMUTABLE) != 0 &&
+      (sx.stx_attributes & STATX_ATTR_IMMUTABLE) != 0) {
+    *flags |= kFileFlagUserImmutable;
+  }
+  return 0;
+}
+
+int lchflags(const char* path, std::uint32_t flags) {
+  if ((flags & ~kFileFlagUserImmutable) != 0) return EOPNOTSUPP;
+  struct stat st {};
+  if (::lstat(path, &st) != 0) return errno;
+  // Opening a device or a FIFO could have effects of its own; links carry no flags.
+  if (!S_ISREG(st.st_mode) && !S_ISDIR(st.st_mode)) return EOPNOTSUPP;
+  const UniqueFd fd(::open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  if (!fd) return errno;
+  int attributes = 0;
+  if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &attributes) != 0) return errno;
+  const int wanted = (flags & kFileFlagUserImmutable) != 0 ? attributes | FS_IMMUTABLE_FL
+                                                           : attributes & ~FS_IMMUTABLE_FL;
+  if (wanted == attributes) return 0;
+  return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &wanted) == 0 ? 0 : errno;
+}
+
+int readWholeFile(const char* path, std::size_t maxSize, std::vector<std::uint8_t>* contents) {
+  contents->clear();
+  const UniqueFd fd(::open(path, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY | O_CLOEXEC));
+  if (!fd) return errno;
+  struct stat st {};
+  if (::fstat(fd.get(), &st) != 0) return errno;
+  if (S_ISDIR(st.st_mode)) return EISDIR;
+  if (!S_ISREG(st.st_mode)) return EINVAL;
+  if (static_cast<std::uint64_t>(st.st_size) > maxSize) return EFBIG;
+  contents->reserve(static_cast<std::size_t>(st.st_size));
+  std::uint8_t buffer[1 << 14];
+  for (;;) {
+    const ssize_t n = ::read(fd.get(), buffer, sizeof buffer);
+    if (n == 0) break;
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      const int error = errno;
+      contents->clear();
+      return error;
+    }
+    if (contents->size() + static_cast<std::size_t>(n) > maxSize) {
+      contents->clear();
+      return EFBIG;
+    }
+    contents->insert(contents->end(), buffer, buffer + n);
+  }
+  ::posix_fadvise(fd.get(), 0, 0, POSIX_FADV_DONTNEED);
+  return 0;
+}
+
+int writeFile(const char* path, std::span<const std::uint8_t> contents,
+              const FileWriteOptions& options) {
+  return options.atomic ? writeAtomically(path, contents, options)
+                        : writeInPlace(path, contents, options);
+}
+
+}  // namespace kestrel::platform

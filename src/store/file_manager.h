@@ -1,0 +1,114 @@
+// KSTFileManager: every file-system operation of the daemon. Stateless; its
+// operations take file URLs, work on their paths with POSIX calls and report
+// failure as POSIX-domain error objects (code = errno, the message, the
+// function and line). Missing items are not failures where things are removed
+// or tested: removal of a missing item succeeds, and it counts as absent.
+// Symbolic links are never followed by traversal, listing, copy or removal.
+//
+// Its access-control-list, protection-class query and disk-usage operations
+// live with the subsystems that use them.
+#pragma once
+
+#include <fts.h>
+#include <sys/types.h>
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <vector>
+
+#include "daemon/errors.h"
+#include "store/file_url.h"
+
+namespace kestrel {
+
+// A data-protection class of the platform: a small signed number saying when a
+// file's contents may be read. A type of its own, so that a class is never
+// taken for an owner; write KSTProtectionClass{0}.
+enum class KSTProtectionClass : std::int32_t {};
+
+// Class 4: the files stay readable while the device is locked. The daemon's
+// own files are written in it ("data-protection class none").
+inline constexpr KSTProtectionClass kKSTProtectionClassNone{4};
+// All bits set (4294967295, -1): leave the class as it is.
+inline constexpr KSTProtectionClass kKSTProtectionClassLeaveAlone{-1};
+// Owner 0: leave the owner as it is.
+inline constexpr uid_t kKSTOwnerLeaveAlone = 0;
+
+// Called for each entry of a traversal (directories twice: before and after
+// their contents). Returns false, with an error or none, to stop the walk.
+using KSTTraversalVisitor = std::function<bool(FTSENT* entry, KSTErrorRef* error)>;
+
+class KSTFileManager {
+ public:
+  // The one file manager of the process.
+  static KSTFileManager& defaultManager();
+
+  // Removes the item and everything beneath it. A missing item is success.
+  bool removeItemAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
+
+  // Makes a directory (with its missing parents when asked) with the mode; an
+  // existing directory keeps its mode. Then sets its protection class, unless
+  // it is kKSTProtectionClassLeaveAlone, and its owner (uid and gid), unless
+  // it is 0.
+  bool createDirectoryAtURL(const KSTFileURL& url, bool withIntermediateDirectories, mode_t mode,
+                            uid_t owner, KSTProtectionClass protectionClass,
+                            KSTErrorRef* error) const;
+  bool createDirectoryAtURL(const KSTFileURL& url, bool withIntermediateDirectories, mode_t mode,
+                            uid_t owner, KSTErrorRef* error) const;
+  bool createDirectoryAtURL(const KSTFileURL& url, bool withIntermediateDirectories, mode_t mode,
+                            KSTProtectionClass protectionClass, KSTErrorRef* error) const;
+  bool createDirectoryAtURL(const KSTFileURL& url, bool withIntermediateDirectories, mode_t mode,
+                            KSTErrorRef* error) const;
+
+  // Copies a file or tree with its data, modes, owners, extended attributes
+  // and ACLs; the destination must not exist. Without failIfSrcMissing a
+  // missing source is success and nothing is done.
+  bool _copyItemAtURL(const KSTFileURL& url, const KSTFileURL& toURL, bool failIfSrcMissing,
+                      KSTErrorRef* error) const;
+  bool copyItemAtURL(const KSTFileURL& url, const KSTFileURL& toURL, KSTErrorRef* error) const;
+  bool copyItemIfExistsAtURL(const KSTFileURL& url, const KSTFileURL& toURL,
+                             KSTErrorRef* error) const;
+
+  // Renames; across file systems, copies and then removes the source (a
+  // source that cannot be removed is logged, and the move still succeeds).
+  bool _moveItemAtURL(const KSTFileURL& url, const KSTFileURL& toURL, bool failIfSrcMissing,
+                      KSTErrorRef* error) const;
+  bool moveItemAtURL(const KSTFileURL& url, const KSTFileURL& toURL, KSTErrorRef* error) const;
+  bool moveItemIfExistsAtURL(const KSTFileURL& url, const KSTFileURL& toURL,
+                             KSTErrorRef* error) const;
+
+  // A new directory "temp.XXXXXX" (mode 0700) in the parent, owned by owner
+  // unless that is 0.
+  std::optional<KSTFileURL> createTemporaryDirectoryInDirectoryURL(const KSTFileURL& url,
+                                                                   uid_t owner,
+                                                                   KSTErrorRef* error) const;
+  std::optional<KSTFileURL> createTemporaryDirectoryInDirectoryURL(const KSTFileURL& url,
+                                                                   KSTErrorRef* error) const;
+
+  // Walks the tree at url physically, on its own file system, calling the
+  // visitor for each entry. True only when every entry was visited.
+  bool _traverseDirectory(const KSTFileURL& url, KSTErrorRef* error,
+                          const KSTTraversalVisitor& withBlock) const;
+
+  // The items of a directory, in directory order, without those whose name
+  // begins with "."; each URL is marked as a directory when the item is one.
+  std::optional<std::vector<KSTFileURL>> urlsForItemsInDirectoryAtURL(const KSTFileURL& url,
+                                                                      KSTErrorRef* error) const;
+
+  bool itemExistsAtURL(const KSTFileURL& url) const;
+  bool itemDoesNotExistAtURL(const KSTFileURL& url) const;
+
+  // Gives every item of the tree (metadata files excepted) the owner and group,
+  // and mode 0755 (directories and executables) or 0644.
+  bool standardizeOwnershipAtURL(const KSTFileURL& url, uid_t toUID, gid_t GID,
+                                 KSTErrorRef* error) const;
+
+  // Logs every item of the tree at error level (used for orphaned data).
+  void printDirectoryStructureAtURL(const KSTFileURL& url) const;
+
+ private:
+  KSTFileManager() = default;
+};
+
+}  // namespace kestrel
