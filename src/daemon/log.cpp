@@ -1,0 +1,75 @@
+#include "daemon/log.h"
+
+#include <atomic>
+#include <mutex>
+
+#include "platform/services.h"
+
+namespace kestrel {
+
+namespace {
+
+struct LogState {
+  std::mutex mutex;
+  std::shared_ptr<platform::LogHandle> handle;
+  std::atomic<int> level{Log::kDefaultLevel};
+  std::atomic<bool> hasHandle{false};
+};
+
+LogState& state() {
+  static LogState s;
+  return s;
+}
+
+std::shared_ptr<platform::LogHandle> currentHandle() {
+  std::lock_guard lock(state().mutex);
+  return state().handle;
+}
+
+}  // namespace
+
+bool Log::open(const std::string& subsystem, const std::string& path, int level) {
+  const auto& logging = platform::services().logging;
+  std::shared_ptr<platform::LogHandle> handle = logging ? logging->open(subsystem, path) : nullptr;
+  std::lock_guard lock(state().mutex);
+  state().handle = handle;
+  state().hasHandle = handle != nullptr;
+  state().level = level;
+  return handle != nullptr;
+}
+
+bool Log::enableDiskLogging(const std::string& path, std::size_t fileCount, std::size_t fileSize,
+                            int options) {
+  auto handle = currentHandle();
+  return handle && handle->enableDiskLogging(path, fileCount, fileSize, options);
+}
+
+bool Log::hasHandle() { return state().hasHandle; }
+int Log::currentLevel() { return state().level; }
+void Log::setCurrentLevel(int level) { state().level = level; }
+
+bool Log::isEnabled(int level) { return !state().hasHandle || state().level >= level; }
+
+void Log::write(int level, std::string_view tag, std::string_view message) {
+  if (!isEnabled(level)) return;
+  if (auto handle = currentHandle()) {
+    handle->write(level, tag, message);
+    return;
+  }
+  if (const auto& logging = platform::services().logging) {
+    logging->writeWithoutHandle(level, tag, message);
+  }
+}
+
+void Log::flush() {
+  if (auto handle = currentHandle()) handle->flush();
+}
+
+void Log::close() {
+  std::lock_guard lock(state().mutex);
+  state().handle.reset();
+  state().hasHandle = false;
+  state().level = kDefaultLevel;
+}
+
+}  // namespace kestrel
