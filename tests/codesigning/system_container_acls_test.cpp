@@ -1,0 +1,430 @@
+#include "codesigning/system_container_acls.h"
+
+#include <acl/libacl.h>
+#include <grp.h>
+#include <gtest/gtest.h>
+#include <sys/acl.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "daemon/log.h"
+#include "platform/fake/fake_extended_acl.h"
+#include "platform/linux/extended_acl_linux.h"
+#include "store/file_manager.h"
+#include "support/fake_services.h"
+
+namespace kestrel {
+namespace {
+
+namespace fs = std::filesystem;
+using platform::AccessControlEntry;
+using platform::AccessControlList;
+
+constexpr gid_t kSystemUsersGid = 499;  // "systemusers" in the scratch root's accounts
+constexpr const char* kMetadata = ".com.zorvane.kestrel.metadata.plist";
+
+AccessControlEntry allow(std::uint32_t permissions, std::uint32_t flags) {
+  return {platform::kACLTagExtendedAllow, permissions, flags,
+          platform::groupMembershipUUID(kSystemUsersGid)};
+}
+const AccessControlList kTopLevel{{allow(16382, 352), allow(1572, 0)}};
+const AccessControlList kDirectory{{allow(16382, 96)}};
+const AccessControlList kFile{{allow(16318, 16)}};
+
+// What the kernel holds for an item: the named-group entries of its access and
+// default lists (rwx bits), and the owner, owning-group and other entries.
+struct PosixView {
+  std::map<gid_t, unsigned> access;
+  std::map<gid_t, unsigned> defaults;
+  unsigned user = 0, group = 0, other = 0;
+  bool hasDefault = false;
+};
+
+void readPosix(const std::string& path, acl_type_t type, PosixView* view) {
+  const platform::UniquePosixACL acl(acl_get_file(path.c_str(), type));
+  ASSERT_TRUE(acl) << path;
+  acl_entry_t entry = nullptr;
+  for (int which = ACL_FIRST_ENTRY; acl_get_entry(acl.get(), which, &entry) == 1;
+       which = ACL_NEXT_ENTRY) {
+    if (type == ACL_TYPE_DEFAULT) view->hasDefault = true;
+    acl_tag_t tag = ACL_UNDEFINED_TAG;
+    acl_get_tag_type(entry, &tag);
+    acl_permset_t permset = nullptr;
+    acl_get_permset(entry, &permset);
+    unsigned bits = 0;
+    for (const acl_perm_t perm : {ACL_READ, ACL_WRITE, ACL_EXECUTE}) {
+      if (acl_get_perm(permset, perm) == 1) bits |= perm;
+    }
+    if (tag == ACL_GROUP) {
+      const auto* gid = static_cast<const gid_t*>(acl_get_qualifier(entry));
+      (type == ACL_TYPE_ACCESS ? view->access : view->defaults)[*gid] = bits;
+      acl_free(const_cast<gid_t*>(gid));
+    } else if (type == ACL_TYPE_ACCESS && tag == ACL_USER_OBJ) {
+      view->user = bits;
+    } else if (type == ACL_TYPE_ACCESS && tag == ACL_GROUP_OBJ) {
+      view->group = bits;
+    } else if (type == ACL_TYPE_ACCESS && tag == ACL_OTHER) {
+      view->other = bits;
+    }
+  }
+}
+
+PosixView posixOf(const std::string& path) {
+  PosixView view;
+  readPosix(path, ACL_TYPE_ACCESS, &view);
+  struct stat st {};
+  if (::lstat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode)) {
+    readPosix(path, ACL_TYPE_DEFAULT, &view);
+  }
+  return view;
+}
+
+class SystemContainerACLsTest : public ::testing::Test {
+ protected:
+  std::string path(const std::string& relative) const {
+    return fakes.scratch.path() + "/" + relative;
+  }
+  KSTFileURL url(const std::string& relative) const { return KSTFileURL(path(relative), true); }
+  void makeFile(const std::string& relative, mode_t mode = 0644) {
+    fs::create_directories(fs::path(path(relative)).parent_path());
+    std::ofstream(path(relative)) << "contents";
+    ASSERT_EQ(::chmod(path(relative).c_str(), mode), 0);
+  }
+  void makeDirectory(const std::string& relative, mode_t mode = 0755) {
+    fs::create_directories(path(relative));
+    ASSERT_EQ(::chmod(path(relative).c_str(), mode), 0);
+  }
+  // A container with a metadata file, directories, a file and two links.
+  void makeContainer(const std::string& relative) {
+    makeDirectory(relative);
+    makeFile(relative + "/" + kMetadata);
+    makeFile(relative + "/Library/Preferences/prefs.plist", 0600);
+    makeDirectory(relative + "/tmp");
+    makeFile("outside/target");
+    fs::create_symlink(path("outside/target"), path(relative + "/Library/link"));
+    fs::create_symlink(path("outside"), path(relative + "/tmp/dirlink"));
+  }
+  std::shared_ptr<platform::LinuxExtendedACL> useLinux() {
+    auto service = std::make_shared<platform::LinuxExtendedACL>(fakes.accounts);
+    fakes.services.extendedACL = service;
+    fakes.install();
+    return service;
+  }
+  std::shared_ptr<platform::FakeExtendedACL> useFake() {
+    auto service = std::make_shared<platform::FakeExtendedACL>(fakes.accounts);
+    fakes.services.extendedACL = service;
+    fakes.install();
+    return service;
+  }
+  static std::optional<AccessControlList> recorded(platform::ExtendedACL& service,
+                                                   const std::string& file) {
+    AccessControlList acl;
+    if (service.getFile(file.c_str(), platform::kACLTypeExtended, &acl) != 0) return std::nullopt;
+    return acl;
+  }
+  static bool hasAnyACL(const std::string& file) {
+    char buffer[8];
+    const bool record = ::lgetxattr(file.c_str(), platform::kExtendedACLAttribute, buffer, 0) >= 0;
+    const platform::UniquePosixACL acl(acl_get_file(file.c_str(), ACL_TYPE_ACCESS));
+    return record || (acl && acl_equiv_mode(acl.get(), nullptr) != 0);
+  }
+
+  testing::FakeServices fakes;
+  const KSTFileManager& fm = KSTFileManager::defaultManager();
+};
+
+TEST_F(SystemContainerACLsTest, SystemContainerTreeGetsTheTemplatesAndTheKernelEntries) {
+  auto service = useLinux();
+  makeContainer("C");
+  KSTErrorRef error;
+  ASSERT_TRUE(fm.standardizeACLsForSystemContainerAtURL(url("C"), &error)) << error;
+
+  struct Row {
+    const char* item;
+    const AccessControlList* record;
+    unsigned access;                    // rwx of group:systemusers
+    std::optional<unsigned> inherited;  // default group:systemusers, on directories
+    bool topLevel;
+  };
+  const Row rows[] = {
+      {"C", &kTopLevel, 03, 07, true},
+      {"C/Library", &kDirectory, 07, 07, false},
+      {"C/Library/Preferences", &kDirectory, 07, 07, false},
+      {"C/tmp", &kDirectory, 07, 07, false},
+      {"C/Library/Preferences/prefs.plist", &kFile, 07, std::nullopt, false},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.item);
+    const std::string item = path(row.item);
+    EXPECT_EQ(recorded(*service, item), *row.record);
+    const PosixView posix = posixOf(item);
+    EXPECT_EQ(posix.access, (std::map<gid_t, unsigned>{{kSystemUsersGid, row.access}}));
+    if (row.inherited) {
+      EXPECT_EQ(posix.defaults, (std::map<gid_t, unsigned>{{kSystemUsersGid, *row.inherited}}));
+    } else {
+      EXPECT_FALSE(posix.hasDefault);
+    }
+    struct stat st {};
+    ASSERT_EQ(::lstat(item.c_str(), &st), 0);
+    if (row.topLevel) {
+      // Mode and owner as they were: rwx r-x r-x, root.
+      EXPECT_EQ(posix.user, 07u);
+      EXPECT_EQ(posix.group, 05u);
+      EXPECT_EQ(posix.other, 05u);
+      EXPECT_EQ(st.st_uid, 0u);
+    } else {
+      // Mode 0000: the group bits the kernel shows are the mask of the grant.
+      EXPECT_EQ(st.st_mode & 0707, 0u);
+      EXPECT_EQ(posix.user | posix.group | posix.other, 0u);
+      EXPECT_EQ(st.st_uid, kKSTSystemContainerItemOwner);
+      EXPECT_EQ(st.st_gid, kKSTSystemContainerItemGroup);
+    }
+  }
+
+  // The metadata file, the links and what they point to are left alone.
+  for (const char* untouched : {"C/.com.zorvane.kestrel.metadata.plist", "C/Library/link",
+                                "C/tmp/dirlink", "outside/target", "outside"}) {
+    SCOPED_TRACE(untouched);
+    EXPECT_FALSE(hasAnyACL(path(untouched)));
+    struct stat st {};
+    ASSERT_EQ(::lstat(path(untouched).c_str(), &st), 0);
+    EXPECT_EQ(st.st_uid, 0u);
+  }
+  struct stat st {};
+  ASSERT_EQ(::lstat(path(std::string("C/") + kMetadata).c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0644u);
+}
+
+// Runs fn in a child process with the identity, and returns its exit status.
+template <typename Fn>
+int runAs(uid_t uid, gid_t gid, Fn fn) {
+  const pid_t child = ::fork();
+  if (child == 0) {
+    if (::setgroups(0, nullptr) != 0 || ::setgid(gid) != 0 || ::setuid(uid) != 0) ::_exit(99);
+    ::_exit(fn());
+  }
+  int status = 0;
+  ::waitpid(child, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : 98;
+}
+
+TEST_F(SystemContainerACLsTest, KernelGrantsTheSystemUsersGroupAndNobodyElse) {
+  useLinux();
+  makeContainer("C");
+  ASSERT_TRUE(fm.standardizeACLsForSystemContainerAtURL(url("C"), nullptr));
+  const std::string prefs = path("C/Library/Preferences/prefs.plist");
+  const std::string top = path("C");
+
+  // A member of "systemusers": full control below, add-only at the top.
+  EXPECT_EQ(runAs(kSystemUsersGid, kSystemUsersGid,
+                  [&] {
+                    if (::access(prefs.c_str(), R_OK | W_OK) != 0) return 1;
+                    if (::mkdir((top + "/Library/new").c_str(), 0777) != 0) return 2;
+                    if (::mkdir((top + "/added").c_str(), 0777) != 0) return 3;
+                    if (::access(top.c_str(), R_OK) == 0 || errno != EACCES)
+                      return 4;  // no listing
+                    return 0;
+                  }),
+            0);
+  // A mobile user gets nothing.
+  EXPECT_EQ(runAs(501, 501,
+                  [&] { return ::access(prefs.c_str(), R_OK) != 0 && errno == EACCES ? 0 : 1; }),
+            0);
+  // What a member made inside inherits the grant.
+  EXPECT_EQ(posixOf(path("C/Library/new")).access,
+            (std::map<gid_t, unsigned>{{kSystemUsersGid, 07}}));
+}
+
+TEST_F(SystemContainerACLsTest, SharedContentTreatsTheStartLikeAnyDirectory) {
+  auto service = useLinux();
+  makeDirectory("S/sub");
+  makeFile("S/sub/file");
+  ASSERT_TRUE(fm.standardizeACLsAtURL(url("S"), false, nullptr));
+  EXPECT_EQ(recorded(*service, path("S")), kDirectory);
+  struct stat st {};
+  ASSERT_EQ(::lstat(path("S").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0707, 0u);
+  EXPECT_EQ(st.st_uid, kKSTSystemContainerItemOwner);
+  EXPECT_EQ(recorded(*service, path("S/sub/file")), kFile);
+}
+
+TEST_F(SystemContainerACLsTest, TopLevelACLOnOnePath) {
+  auto service = useLinux();
+  makeDirectory("T/inside", 0000);
+  ASSERT_EQ(::chmod(path("T").c_str(), 0000), 0);
+  ASSERT_TRUE(fm.setTopLevelSystemContainerACLAtURL(url("T"), nullptr));
+  EXPECT_EQ(recorded(*service, path("T")), kTopLevel);
+  EXPECT_FALSE(hasAnyACL(path("T/inside")));
+
+  KSTErrorRef error;
+  EXPECT_FALSE(fm.setTopLevelSystemContainerACLAtURL(url("missing"), &error));
+  ASSERT_NE(error, nullptr);
+  EXPECT_EQ(error->code(), 63);
+  EXPECT_EQ(error->localizedDescription(),
+            "Failed to set ACL on " + path("missing") + ": No such file or directory");
+}
+
+TEST_F(SystemContainerACLsTest, MissingGroupFailsWith63AndTouchesNothing) {
+  useLinux();
+  fakes.accounts->removeGroup("systemusers");
+  makeContainer("C");
+  KSTErrorRef error;
+  EXPECT_FALSE(fm.setTopLevelSystemContainerACLAtURL(url("C"), &error));
+  ASSERT_NE(error, nullptr);
+  EXPECT_EQ(error->code(), 63);
+  EXPECT_EQ(error->localizedDescription(),
+            "Failed to look up the membership UUID of group systemusers: No such file or "
+            "directory");
+  error.reset();
+  EXPECT_FALSE(fm.standardizeACLsForSystemContainerAtURL(url("C"), &error));
+  ASSERT_NE(error, nullptr);
+  EXPECT_EQ(error->code(), 63);
+  EXPECT_FALSE(hasAnyACL(path("C")));
+  EXPECT_FALSE(hasAnyACL(path("C/Library")));
+}
+
+TEST_F(SystemContainerACLsTest, EachBuildingStepFailsWithItsOwnMessage) {
+  struct Row {
+    const char* step;
+    std::string message;
+  };
+  const std::string eio = std::strerror(EIO);
+  const Row rows[] = {
+      {"acl_init", "acl_init() failed: " + eio},
+      {"acl_create_entry", "acl_create_entry() failed: " + eio},
+      {"lookup_group_uuid", "Failed to look up the membership UUID of group systemusers: " + eio},
+      {"acl_get_permset", "acl_get_permset() failed: " + eio},
+      {"acl_add_perm", "acl_add_perm() failed to set perms 3ffe: " + eio},
+      {"acl_set_permset", "acl_set_permset() failed: " + eio},
+      {"acl_get_flagset_np", "acl_get_flagset_np() failed: " + eio},
+      {"acl_add_flag_np", "acl_add_flag_np() failed to set flags 160: " + eio},
+      {"acl_set_flagset_np", "acl_set_flagset_np() failed: " + eio},
+      {"acl_set_tag_type", "acl_set_tag_type() failed: " + eio},
+      {"acl_set_qualifier", "acl_set_qualifier() failed: " + eio},
+  };
+  auto service = useFake();
+  makeContainer("C");
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.step);
+    service->clearFailures();
+    service->failStep(row.step, EIO);
+    for (const bool wholeTree : {false, true}) {
+      KSTErrorRef error;
+      const bool done = wholeTree ? fm.standardizeACLsForSystemContainerAtURL(url("C"), &error)
+                                  : fm.setTopLevelSystemContainerACLAtURL(url("C"), &error);
+      EXPECT_FALSE(done);
+      ASSERT_NE(error, nullptr);
+      EXPECT_EQ(error->code(), 63);
+      EXPECT_EQ(error->localizedDescription(), row.message);
+    }
+  }
+  // Nothing was set or changed while a template could not be built.
+  EXPECT_TRUE(service->appliedACLs().empty());
+  EXPECT_TRUE(service->modeChanges().empty());
+
+  service->clearFailures();
+  service->failStep("acl_set_file", EACCES);
+  KSTErrorRef error;
+  EXPECT_FALSE(fm.setTopLevelSystemContainerACLAtURL(url("C"), &error));
+  ASSERT_NE(error, nullptr);
+  EXPECT_EQ(error->code(), 63);
+  EXPECT_EQ(error->localizedDescription(),
+            "Failed to set ACL on " + path("C") + ": " + std::strerror(EACCES));
+}
+
+TEST_F(SystemContainerACLsTest, FailuresOnSingleItemsAreLoggedAndTheWalkGoesOn) {
+  auto service = useFake();
+  makeContainer("C");
+  service->failStep("acl_set_file", EPERM, "Preferences");
+  service->failStep("chmod", EPERM, "/C/tmp");
+  ASSERT_TRUE(fm.standardizeACLsForSystemContainerAtURL(url("C"), nullptr));
+
+  const std::string eperm = std::strerror(EPERM);
+  EXPECT_TRUE(fakes.logging->contains(
+      "standardizeACLsAtURL",
+      "Failed to set ACL on dir " + path("C/Library/Preferences") + ": " + eperm));
+  EXPECT_TRUE(fakes.logging->contains(
+      "standardizeACLsAtURL",
+      "Failed to set ACL on dir " + path("C/Library/Preferences/prefs.plist") + ": " + eperm));
+  EXPECT_TRUE(fakes.logging->contains("standardizeACLsAtURL",
+                                      "Could not chmod " + path("C/tmp") + ": " + eperm));
+
+  // Everything else got its list; the top directory keeps its mode; metadata
+  // and links are not visited.
+  const std::map<std::string, AccessControlList> expected{
+      {path("C"), kTopLevel}, {path("C/Library"), kDirectory}, {path("C/tmp"), kDirectory}};
+  EXPECT_EQ(service->appliedACLs(), expected);
+  std::map<std::string, mode_t> modes;
+  for (const auto& [item, mode] : service->modeChanges()) modes[item] = mode;
+  const std::map<std::string, mode_t> expectedModes{{path("C/Library"), 0},
+                                                    {path("C/Library/Preferences"), 0},
+                                                    {path("C/Library/Preferences/prefs.plist"), 0}};
+  EXPECT_EQ(modes, expectedModes);
+
+  // Failing on the top directory is logged with its own message.
+  service->clearFailures();
+  service->failStep("acl_set_file", EPERM, "C");
+  ASSERT_TRUE(fm.standardizeACLsForSystemContainerAtURL(url("C"), nullptr));
+  EXPECT_TRUE(fakes.logging->contains(
+      "standardizeACLsAtURL", "Failed to set top level ACL on dir " + path("C") + ": " + eperm));
+}
+
+TEST_F(SystemContainerACLsTest, EveryContainerOfAClassDirectory) {
+  auto service = useFake();
+  // A class directory that does not exist: success, and not a word.
+  ASSERT_TRUE(fm.standardizeAllSystemContainerACLsAtURL(url("Data/System"), nullptr));
+  EXPECT_TRUE(fakes.logging->lines().empty());
+  makeDirectory("Data/System");
+  ASSERT_TRUE(fm.standardizeAllSystemContainerACLsAtURL(url("Data/System"), nullptr));
+  EXPECT_TRUE(fakes.logging->lines().empty());
+
+  makeContainer("Data/System/A");
+  makeContainer("Data/System/B");
+  ASSERT_TRUE(fm.standardizeAllSystemContainerACLsAtURL(url("Data/System"), nullptr));
+  EXPECT_EQ(service->aclAt(path("Data/System/A")), kTopLevel);
+  EXPECT_EQ(service->aclAt(path("Data/System/B")), kTopLevel);
+  EXPECT_EQ(service->aclAt(path("Data/System/B/tmp")), kDirectory);
+  bool announced = false;
+  for (const auto& line : fakes.logging->lines()) {
+    announced |= line.level == kLogNotice &&
+                 line.message.starts_with("Potential containers requiring ACL migration: ");
+  }
+  EXPECT_TRUE(announced);
+
+  // The first container cannot get its templates; the second is still done.
+  fs::remove_all(path("Data/System"));
+  fs::create_directories(path("Data/System"));
+  makeContainer("Data/System/A");
+  makeContainer("Data/System/B");
+  fakes.logging->clear();
+  service = useFake();
+  service->failStep("acl_init", ENOMEM, "", 1);
+  KSTErrorRef error;
+  EXPECT_FALSE(fm.standardizeAllSystemContainerACLsAtURL(url("Data/System"), &error));
+  ASSERT_NE(error, nullptr);
+  EXPECT_EQ(error->code(), 63);
+  EXPECT_EQ(error->localizedDescription(),
+            std::string("acl_init() failed: ") + std::strerror(ENOMEM));
+  EXPECT_EQ(service->aclAt(path("Data/System/A")).has_value() +
+                service->aclAt(path("Data/System/B")).has_value(),
+            1);
+  int failuresLogged = 0;
+  for (const auto& line : fakes.logging->lines()) {
+    failuresLogged += line.message.starts_with("Failed to set system container ACL at ");
+  }
+  EXPECT_EQ(failuresLogged, 1);
+}
+
+}  // namespace
+}  // namespace kestrel
