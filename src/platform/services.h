@@ -7,6 +7,7 @@
 #include "platform/accounts.h"
 #include "platform/code_signing_identity.h"
 #include "platform/device_info.h"
+#include "platform/extended_acl.h"
 #include "platform/keep_alive.h"
 #include "platform/key_bag.h"
 #include "platform/logging.h"
@@ -30,6 +31,7 @@ struct Services {
   std::shared_ptr<MessageIPC> messageIPC;
   std::shared_ptr<Sandbox> sandbox;
   std::shared_ptr<CodeSigningIdentity> codeSigningIdentity;
+  std::shared_ptr<ExtendedACL> extendedACL;
 };
 
 // The installed services. Installing is done before any other thread uses them.

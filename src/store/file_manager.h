@@ -18,6 +18,7 @@
 #include <vector>
 
 #include "daemon/errors.h"
+#include "platform/extended_acl.h"
 #include "store/file_url.h"
 
 namespace kestrel {
@@ -106,6 +107,31 @@ class KSTFileManager {
 
   // Logs every item of the tree at error level (used for orphaned data).
   void printDirectoryStructureAtURL(const KSTFileURL& url) const;
+
+  // --- Access-control lists of system containers (codesigning/system_container_acls.cpp) ---
+  // Each fails with error 63 naming the call that failed.
+
+  // Appends one allow entry for the group "systemusers" with the permission and flag bits.
+  bool _createSystemUserACEInACL(platform::AccessControlList* acl, std::uint32_t withPermissions,
+                                 std::uint32_t andFlags, KSTErrorRef* error) const;
+  // A new list with room for numACEs holding the directory entry (flags 0x160 when
+  // inheritOnly, else 0x60) or the file entry.
+  std::optional<platform::AccessControlList> _copySystemContainerACLWithNumACEs(
+      int numACEs, bool isDir, bool inheritOnly, KSTErrorRef* error) const;
+  // The two-entry list of a system container's top-level directory.
+  std::optional<platform::AccessControlList> _copyTopLevelSystemContainerACL(
+      KSTErrorRef* error) const;
+  // Sets the top-level list on that one path.
+  bool setTopLevelSystemContainerACLAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
+  // Gives every item of the tree (metadata files and symbolic links excepted) its
+  // list, mode 0000 and owner and group -2; a system container's top directory
+  // gets the top-level list and keeps its mode and owner. Failures on single
+  // items are logged and skipped; only a failed walk fails the operation.
+  bool standardizeACLsAtURL(const KSTFileURL& url, bool isSystemContainer,
+                            KSTErrorRef* error) const;
+  bool standardizeACLsForSystemContainerAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
+  // The above for every item of a class directory; a missing directory is success.
+  bool standardizeAllSystemContainerACLsAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
 
  private:
   KSTFileManager() = default;

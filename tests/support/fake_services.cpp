@@ -14,7 +14,8 @@ FakeServices::FakeServices()
       upcall(std::make_shared<platform::FakeUpcallChannel>()),
       messageIPC(std::make_shared<platform::FakeMessageIPC>()),
       sandbox(std::make_shared<platform::FakeSandbox>()),
-      codeSigningIdentity(std::make_shared<platform::FakeCodeSigningIdentity>()) {
+      codeSigningIdentity(std::make_shared<platform::FakeCodeSigningIdentity>()),
+      extendedACL(std::make_shared<platform::FakeExtendedACL>(accounts)) {
   services.root = scratch.root();
   services.accounts = accounts;
   services.logging = logging;
@@ -26,6 +27,7 @@ FakeServices::FakeServices()
   services.messageIPC = messageIPC;
   services.sandbox = sandbox;
   services.codeSigningIdentity = codeSigningIdentity;
+  services.extendedACL = extendedACL;
   install();
 }
 

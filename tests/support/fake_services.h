@@ -5,6 +5,7 @@
 #include <memory>
 
 #include "platform/fake/fake_code_signing_identity.h"
+#include "platform/fake/fake_extended_acl.h"
 #include "platform/fake/fake_logging.h"
 #include "platform/fake/fake_message_ipc.h"
 #include "platform/fake/fake_platform.h"
@@ -37,6 +38,7 @@ class FakeServices {
   std::shared_ptr<platform::FakeMessageIPC> messageIPC;
   std::shared_ptr<platform::FakeSandbox> sandbox;
   std::shared_ptr<platform::FakeCodeSigningIdentity> codeSigningIdentity;
+  std::shared_ptr<platform::FakeExtendedACL> extendedACL;
 };
 
 }  // namespace kestrel::testing
