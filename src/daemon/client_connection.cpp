@@ -1,0 +1,22 @@
+#include "daemon/client_connection.h"
+
+namespace kestrel {
+
+KSTClientConnection::KSTClientConnection(
+    std::optional<std::string> bundleId, std::uint32_t clientUserId, bool allowOtherIdLookup,
+    std::optional<std::vector<std::string>> entitledWipeIdentifiers)
+    : clientBundleIdentifier_(std::move(bundleId)),
+      clientUserId_(clientUserId),
+      allowOtherIdLookup_(allowOtherIdLookup),
+      entitledWipeIdentifiers_(std::move(entitledWipeIdentifiers)) {}
+
+KSTClientConnection::KSTClientConnection(std::optional<std::string> bundleId,
+                                         bool allowOtherIdLookup)
+    : KSTClientConnection(std::move(bundleId), 0, allowOtherIdLookup, std::nullopt) {}
+
+KSTClientConnection& KSTClientConnection::sharedClientConnection() {
+  static KSTClientConnection shared(std::string(kInternalBundleIdentifier), true);
+  return shared;
+}
+
+}  // namespace kestrel

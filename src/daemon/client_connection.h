@@ -1,0 +1,58 @@
+// The per-request view of a client: its identity and rights. Each request gets
+// its own object; the daemon's own work (start-up, upcalls) runs on the shared
+// one. Its operations are defined in the folders of the subsystems they belong to.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "store/container_class.h"
+#include "store/file_url.h"
+
+namespace kestrel {
+
+class KSTClientConnection {
+ public:
+  static constexpr const char* kInternalBundleIdentifier = "com.zorvane.kestreld.internal";
+
+  KSTClientConnection(std::optional<std::string> bundleId, std::uint32_t clientUserId,
+                      bool allowOtherIdLookup,
+                      std::optional<std::vector<std::string>> entitledWipeIdentifiers);
+  // initWithBundleId:allowOtherIdLookup: (the client user id is 0).
+  KSTClientConnection(std::optional<std::string> bundleId, bool allowOtherIdLookup);
+
+  // The one instance for the daemon's own work, made once.
+  static KSTClientConnection& sharedClientConnection();
+
+  const std::optional<std::string>& clientBundleIdentifier() const { return clientBundleIdentifier_; }
+  std::uint32_t clientUserId() const { return clientUserId_; }
+  bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
+  void setAllowOtherIdLookup(bool allow) { allowOtherIdLookup_ = allow; }
+  bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
+  void setAllowGroupIdLookup(bool allow) { allowGroupIdLookup_ = allow; }
+  const std::optional<std::vector<std::string>>& entitledWipeIdentifiers() const {
+    return entitledWipeIdentifiers_;
+  }
+
+  // Start-up and boot housekeeping of the container store.
+  void rebootContainerManagerSetup();
+  void containerManagerSetup();
+  void rebootContainerManagerCleanup();
+  void containerManagerCleanup();
+
+  bool _setSandboxContainerMappingForUser(std::uint32_t userId, const std::string& identifier,
+                                          KSTContainerClass containerClass,
+                                          const std::optional<KSTFileURL>& url);
+
+ private:
+  std::optional<std::string> clientBundleIdentifier_;
+  std::uint32_t clientUserId_ = 0;
+  bool allowOtherIdLookup_ = false;
+  bool allowGroupIdLookup_ = false;
+  std::optional<std::vector<std::string>> entitledWipeIdentifiers_;
+};
+
+}  // namespace kestrel

@@ -1,0 +1,246 @@
+#include "daemon/startup.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <filesystem>
+#include <thread>
+
+#include "daemon/daemon_state.h"
+#include "daemon/log.h"
+#include "platform/linux/key_bag_linux.h"
+#include "support/fake_services.h"
+
+namespace kestrel {
+namespace {
+
+using namespace std::chrono_literals;
+
+class StartupTest : public ::testing::Test {
+ protected:
+  StartupTest() {
+    hooks.startListener = [this](std::shared_ptr<platform::DispatchQueue> queue) {
+      listenerQueue = queue;
+      transactionsAtListener = fakes.keepAlive->openTransactions();
+      return listenerStarts;
+    };
+  }
+
+  std::vector<std::string> messages() const {
+    std::vector<std::string> result;
+    for (const auto& line : fakes.logging->lines()) result.push_back(line.message);
+    return result;
+  }
+
+  bool logged(const std::string& message) const { return fakes.logging->containsMessage(message); }
+
+  // The messages appear in this order (others may come between them).
+  void expectInOrder(const std::vector<std::string>& expected) const {
+    const auto all = messages();
+    auto from = all.begin();
+    for (const auto& message : expected) {
+      auto found = std::find(from, all.end(), message);
+      ASSERT_NE(found, all.end()) << "missing or out of order: " << message;
+      from = found + 1;
+    }
+  }
+
+  // Runs the main queue until every item queued so far on the main queue ran.
+  static void drainMainQueue() {
+    platform::DispatchQueue::main()->async([] { platform::stopMainLoop(0); });
+    platform::runMainLoop();
+  }
+
+  testing::FakeServices fakes;
+  KSTStartupHooks hooks;
+  bool listenerStarts = true;
+  std::shared_ptr<platform::DispatchQueue> listenerQueue;
+  std::uint64_t transactionsAtListener = 99;
+};
+
+const std::vector<std::string> kFirstBootOrder = {
+    "kestreld performing first boot initialization",
+    "boot-time setup: no migrations or restores to run",
+    "start-up setup: no interrupted operations to recover",
+    "LockState=0",
+    "boot-time cleanup: no transient or orphaned containers to retire",
+    "kestreld first boot cleanup complete",
+    "start-up cleanup: nothing staged to retire",
+};
+
+TEST_F(StartupTest, FirstStartDoesBootWorkInOrderAndLaterStartsSkipItUntilReboot) {
+  // Without a log handle every level is written, so the debug lines show the order.
+  fakes.logging->setOpenFails(true);
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  expectInOrder(kFirstBootOrder);
+  EXPECT_EQ(fakes.semaphores->names(), std::set<std::string>{"kestreld.fb_check"});
+  EXPECT_EQ(fakes.upcall->checkedIn(), std::vector<std::string>{"com.zorvane.kestreld.upcall"});
+  EXPECT_TRUE(fakes.upcall->sourceResumed());
+  EXPECT_EQ(fakes.keyBag->registrationCount(), 1u);
+  ASSERT_NE(listenerQueue, nullptr);
+  EXPECT_EQ(listenerQueue->label(), "com.zorvane.kestreld.listener");
+  EXPECT_EQ(transactionsAtListener, 0u);  // start-up's transaction ended before requests begin
+  EXPECT_GE(fakes.keepAlive->totalBegins(), 1u);
+  EXPECT_EQ(KSTDeathRowQueue()->label(), "com.zorvane.kestreld.deathrow");
+  EXPECT_EQ(KSTLockStateQueue()->label(), "com.zorvane.kestreld.lockstate");
+
+  fakes.logging->clear();
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  EXPECT_FALSE(logged("kestreld performing first boot initialization"));
+  EXPECT_FALSE(logged("kestreld first boot cleanup complete"));
+  expectInOrder({"start-up setup: no interrupted operations to recover",
+                 "start-up cleanup: nothing staged to retire"});
+
+  fakes.semaphores->remove("kestreld.fb_check");  // the system restarted
+  fakes.logging->clear();
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  expectInOrder(kFirstBootOrder);
+}
+
+TEST_F(StartupTest, LogGoesToTheLogDirectoryWithTheBuildsRotation) {
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  const std::string logDir = fakes.scratch.resolve("/private/var/root/Library/Logs/Kestrel");
+  EXPECT_EQ(fakes.logging->openedPath(), logDir + "/kestreld.log");
+  EXPECT_EQ(std::filesystem::status(logDir).permissions() & std::filesystem::perms::all,
+            std::filesystem::perms(0755));
+  EXPECT_TRUE(fakes.logging->systemLog().empty());
+  EXPECT_EQ(Log::currentLevel(), kLogNotice);
+  auto settings = fakes.logging->diskLogging();
+  ASSERT_EQ(settings.size(), 1u);
+  EXPECT_EQ(settings[0].fileCount, 1u);
+  EXPECT_EQ(settings[0].fileSize, 102400u);
+  EXPECT_EQ(settings[0].options, 0);
+
+  fakes.deviceInfo->setInternalBuild(true);
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  settings = fakes.logging->diskLogging();
+  ASSERT_EQ(settings.size(), 2u);
+  EXPECT_EQ(settings[1].path, logDir + "/kestreld.log");
+  EXPECT_EQ(settings[1].fileCount, 4u);
+  EXPECT_EQ(settings[1].fileSize, 262144u);
+}
+
+TEST_F(StartupTest, UnopenableLogIsReportedToTheSystemLogAndStartGoesOn) {
+  fakes.logging->setOpenFails(true);
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  const auto syslog = fakes.logging->systemLog();
+  ASSERT_EQ(syslog.size(), 1u);
+  EXPECT_EQ(syslog[0], "Failed to set up rotating logs at path " +
+                           fakes.scratch.resolve("/private/var/root/Library/Logs/Kestrel/kestreld.log"));
+  EXPECT_TRUE(fakes.logging->diskLogging().empty());
+}
+
+TEST_F(StartupTest, UpcallRegistrationFailureExitsBeforeServing) {
+  struct Row {
+    const char* label;
+    bool checkInFails;
+    bool sourceFails;
+  } rows[] = {{"check-in", true, false}, {"receive source", false, true}};
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.label);
+    fakes.logging->clear();
+    fakes.upcall->setCheckInFails(row.checkInFails);
+    fakes.upcall->setSourceFails(row.sourceFails);
+    listenerQueue.reset();
+    EXPECT_EQ(KSTDaemonStart(hooks), -1);
+    EXPECT_TRUE(logged("Failed to initialize kernel upcall interface. THIS IS BAD! Exiting."));
+    EXPECT_EQ(listenerQueue, nullptr);
+    EXPECT_TRUE(fakes.semaphores->names().empty());  // boot-time work is not marked done
+  }
+}
+
+TEST_F(StartupTest, FailuresThatDoNotStopStartUpAreLogged) {
+  fakes.semaphores->setCreateStatus(EACCES);
+  fakes.keyBag->setRegistrationStatus(5);
+  listenerStarts = false;
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  EXPECT_TRUE(fakes.logging->contains("set_first_boot_work_completed",
+                                      "Failed to create semaphore kestreld.fb_check: Permission denied"));
+  EXPECT_TRUE(logged("Failed to register for com.zorvane.keybag.lock-status: 5"));
+  EXPECT_TRUE(logged("unable to start vexel service!"));
+
+  // The mark was not made, so the next start does the boot-time work again.
+  fakes.semaphores->setCreateStatus(0);
+  fakes.logging->clear();
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  EXPECT_TRUE(logged("kestreld performing first boot initialization"));
+}
+
+TEST_F(StartupTest, LockedDeviceHoldsTheLockStateQueueUntilTheLockStateFileSaysUnlocked) {
+  // The real key bag, watching the lock-state file beneath the scratch root.
+  fakes.services.keyBag = std::make_shared<platform::LinuxKeyBag>(fakes.scratch.root());
+  fakes.install();
+  fakes.scratch.writeFile("/run/kestrel/lock-state", "1\n");
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  EXPECT_TRUE(KSTIsLocked());
+
+  std::atomic<bool> ran{false};
+  KSTLockStateQueue()->async([&] { ran = true; });
+  std::this_thread::sleep_for(100ms);
+  EXPECT_FALSE(ran);
+
+  fakes.scratch.writeFile("/run/kestrel/lock-state", "0\n");
+  // The notification arrives on the main queue; run it until the queued work ran.
+  const auto deadline = std::chrono::steady_clock::now() + 10s;
+  while (!ran && std::chrono::steady_clock::now() < deadline) {
+    platform::DispatchQueue::main()->async([] { platform::stopMainLoop(0); });
+    platform::runMainLoop();
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_TRUE(ran);
+  EXPECT_FALSE(KSTIsLocked());
+}
+
+TEST_F(StartupTest, LockStatesOtherThanLockedOrUnlockedChangeNothing) {
+  fakes.keyBag->setLockState(1);
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  ASSERT_TRUE(KSTIsLocked());
+
+  fakes.keyBag->setLockState(2);
+  fakes.keyBag->notifyLockStatusChanged();
+  drainMainQueue();
+  EXPECT_TRUE(KSTIsLocked());
+
+  fakes.keyBag->setLockState(0);
+  fakes.keyBag->notifyLockStatusChanged();
+  drainMainQueue();
+  EXPECT_FALSE(KSTIsLocked());
+
+  fakes.keyBag->setLockState(-1);
+  fakes.keyBag->notifyLockStatusChanged();
+  drainMainQueue();
+  EXPECT_FALSE(KSTIsLocked());
+  // Still running: work queued now runs.
+  std::atomic<bool> ran{false};
+  KSTLockStateQueue()->sync([&] { ran = true; });
+  EXPECT_TRUE(ran);
+}
+
+TEST_F(StartupTest, RepeatedLockNotificationsKeepSuspendAndResumeBalanced) {
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  for (int state : {1, 1, 1, 0, 0, 1, 0}) {
+    fakes.keyBag->setLockState(state);
+    fakes.keyBag->notifyLockStatusChanged();
+    drainMainQueue();
+  }
+  EXPECT_FALSE(KSTIsLocked());
+  std::atomic<bool> ran{false};
+  KSTLockStateQueue()->sync([&] { ran = true; });  // would hang if a suspend were left over
+  EXPECT_TRUE(ran);
+}
+
+TEST_F(StartupTest, AsyncWithTransactionHoldsTheDaemonAliveUntilTheBlockReturns) {
+  ASSERT_EQ(KSTDaemonStart(hooks), 0);
+  std::atomic<std::uint64_t> openDuring{0};
+  auto queue = platform::DispatchQueue::createSerial("test.transaction");
+  KSTDispatchAsyncWithTransaction(queue, [&] { openDuring = fakes.keepAlive->openTransactions(); });
+  queue->sync([] {});
+  EXPECT_EQ(openDuring, 1u);
+  EXPECT_EQ(fakes.keepAlive->openTransactions(), 0u);
+}
+
+}  // namespace
+}  // namespace kestrel
