@@ -6,24 +6,43 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 scripts/setup.sh
 cmake --preset release >/dev/null
-cmake --build --preset release --target kestreld >/dev/null
+cmake --build --preset release --target kestreld kestrelctl >/dev/null
 root=$(tools/make-scratch-root.sh)
+ctl=$PWD/build/release/tools/kestrelctl
+# Register kestrelctl as an installer-like client with the "allowed" entitlement.
+mkdir -p "$root/etc/kestrel/signatures"
+chmod 0755 "$root/etc/kestrel" "$root/etc/kestrel/signatures"
+cat > "$root/etc/kestrel/signatures/kestrelctl.plist" <<PLIST
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+  <key>SigningIdentifier</key><string>com.zorvane.kestrelctl</string>
+  <key>Executable</key><string>$ctl</string>
+  <key>Entitlements</key><dict>
+    <key>com.zorvane.private.Kestrel.allowed</key><true/>
+  </dict>
+</dict></plist>
+PLIST
+chmod 0644 "$root/etc/kestrel/signatures/kestrelctl.plist"
 log="$root/private/var/root/Library/Logs/Kestrel/kestreld.log"
 upcall="$root/run/kestrel/com.zorvane.kestreld.upcall"
+socket="$root/run/kestrel/com.zorvane.kestreld"
 
 KESTREL_ROOT="$root" build/release/kestreld &
 pid=$!
 trap 'kill -TERM $pid 2>/dev/null || true; wait $pid 2>/dev/null || true' EXIT
-for _ in $(seq 100); do [[ -S "$upcall" ]] && break; sleep 0.05; done
-[[ -S "$upcall" ]] || { echo "kestreld did not come up" >&2; exit 1; }
+for _ in $(seq 100); do [[ -S "$socket" ]] && break; sleep 0.05; done
+[[ -S "$socket" ]] || { echo "kestreld did not come up" >&2; exit 1; }
 
 cat <<INFO
 kestreld is up (pid $pid)
-  root:          $root
-  log:           $log
-  upcall socket: $upcall
-  stop it with:  Ctrl-C, or kill -TERM $pid
+  root:           $root
+  log:            $log
+  request socket: $socket
+  upcall socket:  $upcall
+  stop it with:   Ctrl-C, or kill -TERM $pid
 INFO
+echo "--- a request: kestrelctl --root $root call 25 UserID=u64:501"
+"$ctl" --root "$root" call 25 UserID=u64:501
 echo "--- $log"
 cat "$log"
 if [[ -t 0 ]]; then

@@ -1,0 +1,247 @@
+#include "daemon/request_dispatch.h"
+
+#include <gtest/gtest.h>
+
+#include <chrono>
+
+#include "daemon/daemon_state.h"
+#include "daemon/error_codes.h"
+#include "support/fake_services.h"
+
+namespace kestrel {
+namespace {
+
+using namespace std::chrono_literals;
+using platform::MessageDictionary;
+
+constexpr pid_t kClientPid = 4242;
+
+class RequestDispatchTest : public ::testing::Test {
+ protected:
+  RequestDispatchTest() {
+    EXPECT_TRUE(KSTStartRequestListener(platform::DispatchQueue::createConcurrent("test.listener")));
+  }
+
+  std::shared_ptr<platform::FakeMessageConnection> connect(uid_t uid,
+                                                           std::optional<PlistDictionary> entitlements,
+                                                           std::optional<std::string> identifier = "com.example.client") {
+    platform::CodeSigningIdentityResult identity;
+    identity.signingIdentifier = std::move(identifier);
+    identity.entitlements = std::move(entitlements);
+    if (!identity.signingIdentifier) identity.error = "not signed";
+    fakes.codeSigningIdentity->setIdentityForPid(kClientPid, identity);
+    platform::PeerCredentials peer;
+    peer.pid = kClientPid;
+    peer.uid = uid;
+    peer.gid = uid;
+    connection = fakes.messageIPC->connect(peer);
+    return connection;
+  }
+
+  std::unique_ptr<KSTClientConnection> admit(std::uint64_t command) {
+    return checkEntitlementsAndInitClientObject(*connection, KSTCommandTable()[command]);
+  }
+
+  static MessageDictionary request(std::uint64_t command) {
+    MessageDictionary message;
+    message.setUint64("Command", command);
+    return message;
+  }
+
+  testing::FakeServices fakes;
+  std::shared_ptr<platform::FakeMessageConnection> connection;
+};
+
+TEST_F(RequestDispatchTest, CommandTableHasEveryRowInPlace) {
+  const auto& table = KSTCommandTable();
+  const std::map<std::uint64_t, std::string> special = {
+      {11, kKSTEntitlementWipeContainer}, {24, kKSTEntitlementDataMigration},
+      {26, kKSTEntitlementStageSharedContent}, {0, kKSTEntitlementNone},
+      {13, kKSTEntitlementNone}, {15, kKSTEntitlementNone}, {16, kKSTEntitlementNone},
+      {17, kKSTEntitlementNone}};
+  for (std::uint64_t i = 0; i < table.size(); ++i) {
+    SCOPED_TRACE(i);
+    EXPECT_EQ(table[i].index, i);
+    auto it = special.find(i);
+    EXPECT_STREQ(table[i].entitlement, it == special.end() ? kKSTEntitlementAllowed : it->second.c_str());
+    EXPECT_EQ(table[i].replyFlag, (i == 4 || i == 21) ? 0 : 1);
+  }
+}
+
+TEST_F(RequestDispatchTest, AdmissionFollowsTheEntitlements) {
+  const PlistDictionary none;
+  const PlistDictionary unrelated{{"com.example.feature", true}};
+  const PlistDictionary allowed{{kKSTEntitlementAllowed, true}};
+  const PlistDictionary allowedAsString{{kKSTEntitlementAllowed, "true"}};
+  const PlistDictionary wipeArray{{kKSTEntitlementWipeContainer, PlistArray{"com.a", 5, "com.b"}}};
+  const PlistDictionary wipeBool{{kKSTEntitlementWipeContainer, true}};
+  const PlistDictionary migration{{kKSTEntitlementDataMigration, true}};
+  const PlistDictionary staging{{kKSTEntitlementStageSharedContent, true}};
+  const PlistDictionary otherId{{kKSTEntitlementOtherIdLookup, true}};
+
+  struct Row {
+    const char* label;
+    std::optional<PlistDictionary> entitlements;
+    std::vector<std::uint64_t> admitted;
+  };
+  const std::vector<std::uint64_t> noneCommands{0, 13, 15, 16, 17};
+  std::vector<std::uint64_t> allowedCommands;
+  for (std::uint64_t i = 0; i < kKSTCommandCount; ++i) {
+    if (i != 24 && i != 26) allowedCommands.push_back(i);
+  }
+  const Row rows[] = {
+      {"no entitlements at all", std::nullopt, {}},
+      {"empty entitlements", none, noneCommands},
+      {"unrelated entitlements", unrelated, noneCommands},
+      {"allowed", allowed, allowedCommands},
+      {"allowed of the wrong type", allowedAsString, noneCommands},
+      {"wipe array", wipeArray, {0, 11, 13, 15, 16, 17}},
+      {"wipe not an array", wipeBool, noneCommands},
+      {"data migration", migration, {0, 13, 15, 16, 17, 24}},
+      {"stage shared content", staging, {0, 13, 15, 16, 17, 26}},
+      {"other id lookup", otherId, noneCommands},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.label);
+    connect(501, row.entitlements);
+    for (std::uint64_t command = 0; command < kKSTCommandCount; ++command) {
+      SCOPED_TRACE(command);
+      const bool expected = std::find(row.admitted.begin(), row.admitted.end(), command) != row.admitted.end();
+      EXPECT_EQ(admit(command) != nullptr, expected);
+    }
+  }
+}
+
+TEST_F(RequestDispatchTest, AdmittedClientCarriesItsIdentityAndRights) {
+  connect(501, PlistDictionary{{kKSTEntitlementWipeContainer, PlistArray{"com.a", 5, "com.b"}},
+                               {kKSTEntitlementOtherIdLookup, true}});
+  auto client = admit(11);
+  ASSERT_NE(client, nullptr);
+  EXPECT_EQ(client->clientBundleIdentifier(), "com.example.client");
+  EXPECT_EQ(client->clientUserId(), 501u);
+  EXPECT_TRUE(client->allowOtherIdLookup());
+  EXPECT_FALSE(client->allowGroupIdLookup());
+  EXPECT_EQ(client->entitledWipeIdentifiers(), (std::vector<std::string>{"com.a", "com.b"}));
+
+  connect(0, PlistDictionary{{kKSTEntitlementAllowed, true}});
+  client = admit(11);
+  ASSERT_NE(client, nullptr);
+  EXPECT_TRUE(client->allowOtherIdLookup());
+  EXPECT_FALSE(client->entitledWipeIdentifiers().has_value());
+  EXPECT_TRUE(fakes.logging->containsMessage("No entitled containers to wipe"));
+}
+
+TEST_F(RequestDispatchTest, RefusalsAndUnreadableIdentifiersAreLogged) {
+  connect(501, std::nullopt);
+  EXPECT_EQ(admit(0), nullptr);  // "none" refuses a peer without entitlements silently
+  EXPECT_FALSE(fakes.logging->containsMessage(
+      "connection attempt from pid 4242 (com.example.client) missing required entitlement: "
+      "com.zorvane.private.Kestrel.none"));
+  EXPECT_EQ(admit(1), nullptr);
+  EXPECT_TRUE(fakes.logging->contains(
+      "checkEntitlementsAndInitClientObject",
+      "connection attempt from pid 4242 (com.example.client) missing required entitlement: "
+      "com.zorvane.private.Kestrel.allowed"));
+
+  connect(501, PlistDictionary{}, std::nullopt);
+  auto client = admit(0);
+  ASSERT_NE(client, nullptr);  // admitted, acting with no own identifier
+  EXPECT_FALSE(client->clientBundleIdentifier().has_value());
+  EXPECT_TRUE(fakes.logging->containsMessage("Failed to copy signing ID for pid 4242 : not signed"));
+}
+
+TEST_F(RequestDispatchTest, UserIdsResolveByClassAndClient) {
+  struct Row {
+    const char* label;
+    std::uint32_t requested;
+    KSTContainerClass containerClass;
+    std::uint32_t client;
+    std::optional<std::uint32_t> resolved;  // nullopt: refused with 38
+  } rows[] = {
+      {"system client, user 1 is the current mobile user", 1, 2, 0, 501},
+      {"system client, another mobile user", 502, 2, 0, 502},
+      {"system client, user 500 is no mobile user", 500, 2, 0, std::nullopt},
+      {"bundle class needs the installer", 33, 1, 0, 33},
+      {"bundle class refuses a mobile user", 501, 1, 0, std::nullopt},
+      {"bundle class refuses user 1", 1, 3, 0, std::nullopt},
+      {"system class needs 499", 499, 12, 501, 499},
+      {"system group class refuses 0", 0, 13, 0, std::nullopt},
+      {"class 0 is never valid", 501, 0, 0, std::nullopt},
+      {"class 14 is never valid", 501, 14, 0, std::nullopt},
+      {"user process names itself", 501, 2, 501, 501},
+      {"user process names user 1", 1, 7, 501, 501},
+      {"user process names another user", 502, 2, 501, std::nullopt},
+      {"user process names root", 0, 2, 501, std::nullopt},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.label);
+    std::uint32_t resolved = 77;
+    std::uint64_t code = kKSTSuccess;
+    const bool ok = validateUserId(row.requested, row.containerClass, row.client, &resolved, &code);
+    EXPECT_EQ(ok, row.resolved.has_value());
+    if (row.resolved) {
+      EXPECT_EQ(resolved, *row.resolved);
+      EXPECT_EQ(code, kKSTSuccess);
+    } else {
+      EXPECT_EQ(resolved, 77u);
+      EXPECT_EQ(code, kKSTErrorInvalidParameter);
+    }
+  }
+  EXPECT_TRUE(fakes.logging->contains("validateUserId", "Invalid userId 502 for class 2 from client 501"));
+  fakes.logging->clear();
+  EXPECT_FALSE(validateUserId(502, 2, 501, nullptr, nullptr));
+  EXPECT_TRUE(fakes.logging->lines().empty());  // no code pointer: no log line
+}
+
+TEST_F(RequestDispatchTest, BadCommandIndexesCloseTheConnectionWithoutReply) {
+  for (std::uint64_t command : {std::uint64_t{27}, std::uint64_t{1000}, std::uint64_t{1} << 63}) {
+    SCOPED_TRACE(command);
+    connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
+    connection->deliver(request(command));
+    EXPECT_TRUE(connection->cancelled());
+    EXPECT_TRUE(connection->replies().empty());
+  }
+  EXPECT_TRUE(fakes.logging->containsMessage("Invalid command index: 27"));
+  EXPECT_TRUE(fakes.logging->containsMessage("Invalid command index: -9223372036854775808"));
+}
+
+TEST_F(RequestDispatchTest, CommandsNotYetServedAndRequestsWithoutReplyContextAreRefused) {
+  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
+  connection->deliver(MessageDictionary{});  // no "Command": reads as 0
+  EXPECT_TRUE(connection->cancelled());
+  EXPECT_TRUE(fakes.logging->containsMessage("Command 0 is not available"));
+
+  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
+  auto message = request(25);
+  message.setUint64("UserID", 501);
+  connection->deliver(message, /*expectReply=*/false);
+  EXPECT_TRUE(connection->cancelled());
+  EXPECT_TRUE(fakes.logging->containsMessage("Dictionary does not have reply context"));
+}
+
+TEST_F(RequestDispatchTest, RetryTestOnACustomerBuildAnswersSuccessAndDoesNothing) {
+  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
+  auto message = request(25);
+  message.setUint64("UserID", 501);
+  message.setUint64("NumRetryCrashes", 3);
+  ASSERT_TRUE(connection->deliver(message));
+  auto reply = connection->lastReply();
+  ASSERT_TRUE(reply.has_value());
+  EXPECT_EQ(reply->uint64("ReplyError"), kKSTSuccess);
+  EXPECT_FALSE(connection->cancelled());
+  EXPECT_TRUE(fakes.logging->contains("retryTest",
+                                      "People really shouldn't be calling this on non-internal installs!"));
+
+  message.setUint64("UserID", 502);  // another user's: refused by the user-id check
+  ASSERT_TRUE(connection->deliver(message));
+  EXPECT_EQ(connection->lastReply()->uint64("ReplyError"), kKSTErrorInvalidParameter);
+
+  fakes.deviceInfo->setInternalBuild(true);
+  message.setUint64("UserID", 501);
+  connection->deliver(message);
+  EXPECT_TRUE(connection->cancelled());
+  EXPECT_EQ(connection->replies().size(), 2u);
+}
+
+}  // namespace
+}  // namespace kestrel

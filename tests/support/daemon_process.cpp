@@ -1,0 +1,103 @@
+#include "support/daemon_process.h"
+
+#include <fcntl.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <thread>
+
+extern char** environ;
+
+namespace kestrel::testing {
+
+namespace {
+
+std::vector<char*> pointers(std::vector<std::string>& strings) {
+  std::vector<char*> result;
+  for (auto& s : strings) result.push_back(s.data());
+  result.push_back(nullptr);
+  return result;
+}
+
+std::vector<std::string> environmentWith(const std::vector<std::string>& extra) {
+  std::vector<std::string> env;
+  for (char** e = environ; *e != nullptr; ++e) env.emplace_back(*e);
+  for (const auto& entry : extra) env.push_back(entry);
+  return env;
+}
+
+}  // namespace
+
+DaemonProcess::DaemonProcess(const std::string& root) {
+  const std::string socket = root + "/run/kestrel/com.zorvane.kestreld";
+  ::unlink(socket.c_str());  // left by an earlier run: readiness is the new socket
+  std::vector<std::string> args{KESTRELD_BINARY};
+  std::vector<std::string> env = environmentWith({"KESTREL_ROOT=" + root});
+  auto argv = pointers(args);
+  auto envp = pointers(env);
+  if (posix_spawn(&pid_, KESTRELD_BINARY, nullptr, nullptr, argv.data(), envp.data()) != 0) {
+    pid_ = -1;
+    return;
+  }
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  struct stat st;
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (::stat(socket.c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) {
+      ready_ = true;
+      return;
+    }
+    int status = 0;
+    if (::waitpid(pid_, &status, WNOHANG) == pid_) {
+      pid_ = -1;
+      return;
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+}
+
+DaemonProcess::~DaemonProcess() { stop(); }
+
+int DaemonProcess::stop() {
+  if (pid_ <= 0) return -1;
+  ::kill(pid_, SIGTERM);
+  int status = 0;
+  ::waitpid(pid_, &status, 0);
+  pid_ = -1;
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+ProcessResult runProcess(const std::string& program, const std::vector<std::string>& arguments,
+                         const std::vector<std::string>& extraEnvironment) {
+  ProcessResult result;
+  int fds[2];
+  if (::pipe2(fds, O_CLOEXEC) != 0) return result;
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_adddup2(&actions, fds[1], STDOUT_FILENO);
+  posix_spawn_file_actions_adddup2(&actions, fds[1], STDERR_FILENO);
+  std::vector<std::string> args{program};
+  args.insert(args.end(), arguments.begin(), arguments.end());
+  std::vector<std::string> env = environmentWith(extraEnvironment);
+  auto argv = pointers(args);
+  auto envp = pointers(env);
+  pid_t pid = -1;
+  const int spawned = posix_spawn(&pid, program.c_str(), &actions, nullptr, argv.data(), envp.data());
+  posix_spawn_file_actions_destroy(&actions);
+  ::close(fds[1]);
+  if (spawned == 0) {
+    char buffer[4096];
+    ssize_t n;
+    while ((n = ::read(fds[0], buffer, sizeof buffer)) > 0) result.output.append(buffer, size_t(n));
+    int status = 0;
+    ::waitpid(pid, &status, 0);
+    result.exitStatus = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  }
+  ::close(fds[0]);
+  return result;
+}
+
+}  // namespace kestrel::testing

@@ -1,0 +1,39 @@
+// The real daemon binary running on a scratch root, stopped with SIGTERM when
+// the owner goes; and client processes run to completion.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+namespace kestrel::testing {
+
+class DaemonProcess {
+ public:
+  // Starts kestreld with KESTREL_ROOT=root and waits until its request socket exists.
+  explicit DaemonProcess(const std::string& root);
+  ~DaemonProcess();
+  DaemonProcess(const DaemonProcess&) = delete;
+  DaemonProcess& operator=(const DaemonProcess&) = delete;
+
+  pid_t pid() const { return pid_; }
+  bool ready() const { return ready_; }
+  // Sends SIGTERM and returns the exit status (or -1).
+  int stop();
+
+ private:
+  pid_t pid_ = -1;
+  bool ready_ = false;
+};
+
+struct ProcessResult {
+  int exitStatus = -1;
+  std::string output;  // standard output and error together
+};
+
+// Runs the program with the arguments and environment entries added to this process's.
+ProcessResult runProcess(const std::string& program, const std::vector<std::string>& arguments,
+                         const std::vector<std::string>& extraEnvironment = {});
+
+}  // namespace kestrel::testing
