@@ -49,16 +49,16 @@ std::string FormatArg::description() const {
 namespace {
 
 template <typename T>
-void appendPrintf(std::string& out, const std::string& spec, T value) {
+void appendPrintf(std::string& out, const std::string& pattern, T value) {
   char stackBuf[256];
-  int n = std::snprintf(stackBuf, sizeof stackBuf, spec.c_str(), value);
+  int n = std::snprintf(stackBuf, sizeof stackBuf, pattern.c_str(), value);
   if (n < 0) return;
   if (static_cast<size_t>(n) < sizeof stackBuf) {
     out.append(stackBuf, static_cast<size_t>(n));
     return;
   }
   std::string big(static_cast<size_t>(n) + 1, '\0');
-  std::snprintf(big.data(), big.size(), spec.c_str(), value);
+  std::snprintf(big.data(), big.size(), pattern.c_str(), value);
   big.resize(static_cast<size_t>(n));
   out += big;
 }
