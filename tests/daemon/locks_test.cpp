@@ -255,29 +255,6 @@ TEST_F(LocksConcurrencyTest, ArraysAreTakenAscendingAndReleasedDescendingEachIde
   }
 }
 
-// Two requests locking the same identifiers in opposite orders: both take the
-// smaller first, so while one holds it the other waits without holding anything.
-TEST_F(LocksConcurrencyTest, OppositeOrdersContendOnTheSmallestIdentifierFirst) {
-  LockHolder first([](const std::function<void()>& hold) {
-    KSTIdentifierLockGuard guard(std::vector<std::string>{"a", "b"}, kKSTLockForWriting);
-    hold();
-  });
-  ASSERT_TRUE(first.waitAcquired());
-
-  LockHolder second([](const std::function<void()>& hold) {
-    KSTIdentifierLockGuard guard(std::vector<std::string>{"b", "a"}, kKSTLockForWriting);
-    hold();
-  });
-  ASSERT_TRUE(waitForLine("take_one_lock", "Waiting to lock a for writing", 2));
-  std::this_thread::sleep_for(kSettle);
-  EXPECT_FALSE(second.acquired());
-  // The second request never got as far as "b".
-  EXPECT_EQ(countLines("take_one_lock", "Waiting to lock b for writing"), 1u);
-
-  first.release();
-  EXPECT_TRUE(second.waitAcquired());
-}
-
 // Many threads mixing every kind of lock; each holder checks, on entry and
 // again before it leaves, that nobody it excludes holds a lock at the same time.
 TEST_F(LocksConcurrencyTest, MixedLockersNeverOverlapWhereTheyExcludeEachOther) {
@@ -287,62 +264,40 @@ TEST_F(LocksConcurrencyTest, MixedLockersNeverOverlapWhereTheyExcludeEachOther) 
   constexpr int kThreads = 8;
   constexpr int kIterations = 1500;
   const std::array<std::string, 3> identifiers = {"A", "B", "C"};
-  std::array<std::atomic<int>, 3> identifierWriters{};
-  std::array<std::atomic<int>, 3> identifierReaders{};
-  std::atomic<int> allWriters{0};
-  std::atomic<int> allReaders{0};
-  std::atomic<int> violations{0};
-  std::atomic<int> allWriterEntries{0};
-
-  auto sum = [](const std::array<std::atomic<int>, 3>& counts) {
-    return counts[0].load() + counts[1].load() + counts[2].load();
+  // Holders of each kind: identifier writers and readers per identifier, and of all identifiers.
+  std::array<std::atomic<int>, 3> writers{}, readers{};
+  std::atomic<int> allWriters{0}, allReaders{0}, violations{0}, allWriterEntries{0};
+  auto anyIdentifierHeld = [&](const std::array<std::atomic<int>, 3>& counts) {
+    return counts[0] + counts[1] + counts[2] > 0;
   };
-  auto expect = [&](bool ok) {
-    if (!ok) ++violations;
+  // Checks on entry and again before leaving, with a yield between.
+  auto twice = [&](const std::function<bool()>& ok) {
+    for (int i = 0; i < 2; ++i, std::this_thread::yield()) violations += ok() ? 0 : 1;
   };
-  auto checkIdentifiers = [&](const std::vector<std::size_t>& held, bool forWriting) {
-    for (std::size_t k : held) {
-      if (forWriting) {
-        expect(identifierWriters[k] == 1 && identifierReaders[k] == 0);
-        expect(allWriters == 0 && allReaders == 0);
-      } else {
-        expect(identifierWriters[k] == 0 && allWriters == 0);
-      }
-    }
-  };
-  auto holdIdentifiers = [&](const std::vector<std::size_t>& picked, bool forWriting) {
+  auto holdIdentifiers = [&](std::vector<std::size_t> picked, bool forWriting) {
     std::vector<std::string> names;
     for (std::size_t k : picked) names.push_back(identifiers[k]);
     KSTIdentifierLockGuard guard(names, forWriting);
-    std::vector<std::size_t> held = picked;
-    std::sort(held.begin(), held.end());
-    held.erase(std::unique(held.begin(), held.end()), held.end());
-    auto& counts = forWriting ? identifierWriters : identifierReaders;
-    for (std::size_t k : held) ++counts[k];
-    checkIdentifiers(held, forWriting);
-    std::this_thread::yield();
-    checkIdentifiers(held, forWriting);
-    for (std::size_t k : held) --counts[k];
+    std::sort(picked.begin(), picked.end());
+    picked.erase(std::unique(picked.begin(), picked.end()), picked.end());
+    for (std::size_t k : picked) ++(forWriting ? writers : readers)[k];
+    twice([&] {
+      for (std::size_t k : picked) {
+        if (writers[k] != (forWriting ? 1 : 0) || allWriters != 0) return false;
+        if (forWriting && (readers[k] != 0 || allReaders != 0)) return false;
+      }
+      return true;
+    });
+    for (std::size_t k : picked) --(forWriting ? writers : readers)[k];
   };
   auto holdAll = [&](bool forWriting) {
     KSTAllIdentifiersLockGuard guard(forWriting);
-    auto check = [&] {
-      if (forWriting) {
-        expect(allWriters == 1 && allReaders == 0);
-        expect(sum(identifierWriters) == 0 && sum(identifierReaders) == 0);
-      } else {
-        expect(allWriters == 0 && sum(identifierWriters) == 0);
-      }
-    };
-    if (forWriting) {
-      ++allWriters;
-      ++allWriterEntries;
-    } else {
-      ++allReaders;
-    }
-    check();
-    std::this_thread::yield();
-    check();
+    ++(forWriting ? allWriters : allReaders);
+    allWriterEntries += forWriting ? 1 : 0;
+    twice([&] {
+      if (allWriters != (forWriting ? 1 : 0) || anyIdentifierHeld(writers)) return false;
+      return !forWriting || (allReaders == 0 && !anyIdentifierHeld(readers));
+    });
     --(forWriting ? allWriters : allReaders);
   };
 

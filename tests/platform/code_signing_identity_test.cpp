@@ -124,6 +124,16 @@ std::string binaryEntry(const std::string& identifier, const std::string& execut
   return result;
 }
 
+// Setup of a row: writes gamma.plist as a dictionary of `items` (plus the gamma client's
+// path under `matchKey`, if any) and returns the gamma client as the peer.
+std::function<PeerCredentials(Registry&)> gamma(std::string items, const char* matchKey) {
+  return [items, matchKey](Registry& r) {
+    const std::string match = matchKey ? stringItem(matchKey, r.client("gamma")) : "";
+    r.writeEntry("gamma.plist", plistDocument("<dict>" + items + match + "</dict>"));
+    return r.peer(r.client("gamma"));
+  };
+}
+
 TEST(CodeSigningIdentityTest, IdentifiesPeersFromTheRegistry) {
   const PlistDictionary alphaEntitlements{{kAllowed, true}};
   struct Row {
@@ -187,8 +197,6 @@ TEST(CodeSigningIdentityTest, IdentifiesPeersFromTheRegistry) {
          return r.peer(path);
        },
        nullptr, std::nullopt, "cannot be examined"},
-      {"unknown executable", [](Registry& r) { return r.peer(r.client("gamma")); }, nullptr,
-       std::nullopt, "no registered identity for "},
       {"peer with neither label nor executable", [](Registry& r) { return r.peer(std::nullopt); },
        nullptr, std::nullopt, "no security label and no executable known for pid 4242"},
       {"entry without entitlements gives the identifier alone",
@@ -213,42 +221,18 @@ TEST(CodeSigningIdentityTest, IdentifiesPeersFromTheRegistry) {
        },
        "com.example.alpha", alphaEntitlements, ""},
       {"identifier that is not a string",
-       [](Registry& r) {
-         r.writeEntry("gamma.plist",
-                      plistDocument("<dict><key>SigningIdentifier</key><integer>7</integer>" +
-                                    stringItem("Executable", r.client("gamma")) + "</dict>"));
-         return r.peer(r.client("gamma"));
-       },
-       nullptr, std::nullopt, "gamma.plist has no \"SigningIdentifier\" string"},
+       gamma("<key>SigningIdentifier</key><integer>7</integer>", "Executable"), nullptr,
+       std::nullopt, "gamma.plist has no \"SigningIdentifier\" string"},
       {"entitlements that are not a dictionary",
-       [](Registry& r) {
-         r.writeEntry(
-             "gamma.plist",
-             plistDocument("<dict>" + stringItem("SigningIdentifier", "com.example.gamma") +
-                           stringItem("Executable", r.client("gamma")) +
-                           "<key>Entitlements</key><array/></dict>"));
-         return r.peer(r.client("gamma"));
-       },
+       gamma(stringItem("SigningIdentifier", "g") + "<key>Entitlements</key><array/>",
+             "Executable"),
        nullptr, std::nullopt, "gamma.plist has an \"Entitlements\" value that is not"},
       {"entry with both a label and an executable",
-       [](Registry& r) {
-         r.writeEntry(
-             "gamma.plist",
-             plistDocument("<dict>" + stringItem("SigningIdentifier", "com.example.gamma") +
-                           stringItem("Executable", r.client("gamma")) +
-                           stringItem("Label", kLabel) + "</dict>"));
-         return r.peer(r.client("gamma"));
-       },
+       gamma(stringItem("SigningIdentifier", "g") + stringItem("Label", kLabel), "Executable"),
        nullptr, std::nullopt, "gamma.plist must have exactly one of"},
       {"label that is not a string",
-       [](Registry& r) {
-         r.writeEntry(
-             "gamma.plist",
-             plistDocument("<dict>" + stringItem("SigningIdentifier", "com.example.gamma") +
-                           "<key>Label</key><true/></dict>"));
-         return r.peer(std::nullopt, "true");
-       },
-       nullptr, std::nullopt, "gamma.plist has a \"Label\" that is not"},
+       gamma(stringItem("SigningIdentifier", "g") + "<key>Label</key><true/>", nullptr), nullptr,
+       std::nullopt, "gamma.plist has a \"Label\" that is not"},
       {"executable that is not a normalized absolute path",
        [](Registry& r) {
          r.writeEntry("gamma.plist",

@@ -17,10 +17,8 @@
 #include <condition_variable>
 #include <cstring>
 #include <filesystem>
-#include <functional>
 #include <mutex>
 #include <optional>
-#include <random>
 #include <string>
 #include <thread>
 #include <vector>
@@ -268,28 +266,23 @@ TEST_F(DBusListenerTest, BusClientsGetAHelloAndIntrospection) {
       0)
       << (error.message ? error.message : "");
   MessagePtr owned(reply);
+  sd_bus_error_free(&error);
   const char* xml = nullptr;
-  MessagePtr ownerReply;
-  {
-    sd_bus_message* raw = nullptr;
-    sd_bus_error ownerError = SD_BUS_ERROR_NULL;
-    // dbus-python resolves the service name before it calls.
-    ASSERT_GE(sd_bus_call_method(client.bus(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                                 "org.freedesktop.DBus", "GetNameOwner", &ownerError, &raw, "s",
-                                 kService),
-              0);
-    ownerReply.reset(raw);
-    sd_bus_error_free(&ownerError);
-    const char* owner = nullptr;
-    ASSERT_GE(sd_bus_message_read(raw, "s", &owner), 0);
-    EXPECT_EQ(owner[0], ':');
-  }
   ASSERT_GE(sd_bus_message_read(reply, "s", &xml), 0);
   const std::string text(xml);
   EXPECT_NE(text.find("<interface name=\"com.zorvane.kestreld\">"), std::string::npos) << text;
   EXPECT_NE(text.find("<method name=\"Request\">"), std::string::npos) << text;
-  EXPECT_NE(text.find("type=\"a{sv}\""), std::string::npos) << text;
-  sd_bus_error_free(&error);
+
+  // Clients that resolve the service name before they call get an owner.
+  sd_bus_message* raw = nullptr;
+  ASSERT_GE(
+      sd_bus_call_method(client.bus(), "org.freedesktop.DBus", "/org/freedesktop/DBus",
+                         "org.freedesktop.DBus", "GetNameOwner", nullptr, &raw, "s", kService),
+      0);
+  MessagePtr ownerReply(raw);
+  const char* owner = nullptr;
+  ASSERT_GE(sd_bus_message_read(raw, "s", &owner), 0);
+  EXPECT_EQ(owner[0], ':');
 }
 
 TEST_F(DBusListenerTest, BadCallsGetStandardErrorsAndTheConnectionGoesOn) {
@@ -370,52 +363,38 @@ TEST_F(DBusListenerTest, PeerThatDoesNotReadItsRepliesIsClosed) {
   EXPECT_EQ(Client(address()).call(withSeq(3)).reply.uint64("Seq"), 3u);
 }
 
-TEST_F(DBusListenerTest, CallWithoutReplyExpectedHasNoReplyContext) {
+TEST_F(DBusListenerTest, OneWayCallsAndCancelledConnectionsGetNoReply) {
   std::optional<bool> hadContext;
-  std::optional<bool> couldMakeReply;
   Signal handled;
   listen([&](std::shared_ptr<MessageConnection> connection, ReceivedMessage message) {
     if (message.dictionary().boolean("OneWay")) {
-      hadContext = message.hasReplyContext();
-      couldMakeReply = message.makeReply().has_value();
+      hadContext = message.hasReplyContext() || message.makeReply().has_value();
       EXPECT_FALSE(connection->sendReply(message, MessageDictionary()));
       handled.set();
-      return;
+    } else if (message.dictionary().boolean("Refuse")) {
+      connection->cancel();
+    } else {
+      connection->sendReply(message, *message.makeReply());
     }
-    connection->sendReply(message, *message.makeReply());
   });
   Client client(address());
-  MessageDictionary oneWay;
-  oneWay.setBoolean("OneWay", true);
-  MessagePtr m = client.newRequest(oneWay);
+  MessageDictionary request;
+  request.setBoolean("OneWay", true);
+  MessagePtr m = client.newRequest(request);
   ASSERT_GE(sd_bus_message_set_expect_reply(m.get(), 0), 0);
   ASSERT_GE(sd_bus_send(client.bus(), m.get(), nullptr), 0);
   ASSERT_GE(sd_bus_flush(client.bus()), 0);
   ASSERT_TRUE(handled.wait());
   EXPECT_EQ(hadContext, false);
-  EXPECT_EQ(couldMakeReply, false);
   EXPECT_GE(client.call(MessageDictionary()).status, 0);
-}
 
-TEST_F(DBusListenerTest, CancelClosesTheConnectionWithoutAReply) {
-  listen([](std::shared_ptr<MessageConnection> connection, ReceivedMessage message) {
-    if (message.dictionary().boolean("Refuse")) {
-      connection->cancel();
-      return;
-    }
-    connection->sendReply(message, *message.makeReply());
-  });
-  Client refused(address());
-  MessageDictionary request;
+  request = MessageDictionary();
   request.setBoolean("Refuse", true);
-  const CallResult result = refused.call(request);
-  EXPECT_LT(result.status, 0);
+  const CallResult result = client.call(request);
   EXPECT_TRUE(result.status == -ECONNRESET || result.status == -ENOTCONN ||
               result.errorName == SD_BUS_ERROR_NO_REPLY)
       << result.status << " " << result.errorName;
-
-  Client other(address());
-  EXPECT_GE(other.call(MessageDictionary()).status, 0);
+  EXPECT_GE(Client(address()).call(MessageDictionary()).status, 0);
 }
 
 TEST_F(DBusListenerTest, PeerCredentialsAreThoseOfTheClientProcess) {
@@ -457,36 +436,18 @@ TEST_F(DBusListenerTest, PeerCredentialsAreThoseOfTheClientProcess) {
   EXPECT_EQ(std::filesystem::path(*seen->executablePath).filename(), "busctl");
 }
 
-TEST_F(DBusListenerTest, CredentialsOfAThreadInThisProcess) {
-  std::optional<PeerCredentials> seen;
-  listen([&](std::shared_ptr<MessageConnection> connection, ReceivedMessage message) {
-    seen = connection->peerCredentials();
-    connection->sendReply(message, *message.makeReply());
-  });
-  Client client(address());
-  ASSERT_GE(client.call(MessageDictionary()).status, 0);
-  ASSERT_TRUE(seen);
-  EXPECT_EQ(seen->pid, ::getpid());
-  EXPECT_EQ(seen->executablePath, std::filesystem::read_symlink("/proc/self/exe").string());
-}
-
 // ---------------------------------------------------------------------------
 // Threads
 
 class DBusListenerConcurrencyTest : public DBusListenerTest {};
 
 TEST_F(DBusListenerConcurrencyTest, PipelinedRequestsOfOneConnectionAreAnsweredInOrder) {
-  std::mutex mutex;
-  std::mt19937 random(42);
   listen([&](std::shared_ptr<MessageConnection> connection, ReceivedMessage message) {
-    int delay;
-    {
-      std::lock_guard lock(mutex);
-      delay = std::uniform_int_distribution<int>(0, 2000)(random);
-    }
-    std::this_thread::sleep_for(std::chrono::microseconds(delay));
+    // Uneven delays: a later request often finishes its handler first.
+    const std::uint64_t seq = message.dictionary().uint64("Seq");
+    std::this_thread::sleep_for(std::chrono::microseconds((seq * 7919) % 2000));
     auto reply = *message.makeReply();
-    reply.setUint64("Seq", message.dictionary().uint64("Seq"));
+    reply.setUint64("Seq", seq);
     connection->sendReply(message, std::move(reply));
   });
 

