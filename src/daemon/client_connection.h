@@ -4,11 +4,13 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "daemon/errors.h"
 #include "store/container_class.h"
 #include "store/file_url.h"
 
@@ -46,6 +48,14 @@ class KSTClientConnection {
   bool _setSandboxContainerMappingForUser(std::uint32_t userId, const std::string& identifier,
                                           KSTContainerClass containerClass,
                                           const std::optional<KSTFileURL>& url);
+
+  // Death row (operations/death_row.cpp). The two moves run on the caller's
+  // thread; the sweep runs later on the death-row queue and hands its code to
+  // the completion there (when one is given).
+  bool _removeItemOrMoveToTempAtURL(const KSTFileURL& url, KSTErrorRef* error);
+  bool _moveItemAtURLToDeathRow(const KSTFileURL& url, bool isDir, bool startDeletionThread,
+                                KSTErrorRef* error);
+  void deleteContainersOnDeathRowWithCompletion(std::function<void(std::uint64_t code)> completion);
 
  private:
   std::optional<std::string> clientBundleIdentifier_;

@@ -45,6 +45,15 @@ std::optional<std::vector<std::uint32_t>> _getListOfValidUserIds() {
 
 std::shared_ptr<platform::DispatchQueue> KSTDeathRowQueue() {
   std::lock_guard lock(queues().mutex);
+  // Work can be sent to death row before start-up made the queues (tools and
+  // tests that run no start-up): the queue is made here then, as start-up makes it.
+  if (!queues().deathRow) {
+    queues().deathRow = platform::DispatchQueue::createSerial(kKSTDeathRowQueueLabel);
+    if (queues().deathRow) {
+      queues().deathRow->setTarget(
+          platform::DispatchQueue::global(platform::QueuePriority::Background));
+    }
+  }
   return queues().deathRow;
 }
 
