@@ -9,6 +9,14 @@ namespace kestrel {
 // Whether this build of the daemon serves the row's command.
 bool KSTCommandIsAvailable(const KSTCommandRow& row);
 
+// 4: the death-row sweep; replies from its completion.
+void KSTHandleDeleteDeathRow(KSTCommandContext& context);
+
+// 19: an identifier's code-signing information, as an external request sees it.
+void KSTHandleGetCodeSigningInfo(KSTCommandContext& context);
+// 20: invalidates the code-signing information of apps without a bundle container.
+void KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer(KSTCommandContext& context);
+
 // 25: the retry test, on internal builds only.
 void KSTHandleRetryTest(KSTCommandContext& context);
 

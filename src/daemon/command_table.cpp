@@ -11,7 +11,7 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {1, nullptr, kKSTEntitlementAllowed, 1},              // list the containers of a class
       {2, nullptr, kKSTEntitlementAllowed, 1},              // replace a container by another
       {3, nullptr, kKSTEntitlementAllowed, 1},              // stage containers for deletion
-      {4, nullptr, kKSTEntitlementAllowed, 0},              // destroy what is on death row
+      {4, KSTHandleDeleteDeathRow, kKSTEntitlementAllowed, 0},  // destroy what is on death row
       {5, nullptr, kKSTEntitlementAllowed, 1},              // set an info value
       {6, nullptr, kKSTEntitlementAllowed, 1},              // get an info value
       {7, nullptr, kKSTEntitlementAllowed, 1},              // get a container's metadata
@@ -26,8 +26,9 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {16, nullptr, kKSTEntitlementNone, 1},                // system group container paths
       {17, nullptr, kKSTEntitlementNone, 1},                // one system group container's path
       {18, nullptr, kKSTEntitlementAllowed, 1},             // process code-signing information
-      {19, nullptr, kKSTEntitlementAllowed, 1},             // get code-signing information
-      {20, nullptr, kKSTEntitlementAllowed, 1},             // invalidate apps without bundles
+      {19, KSTHandleGetCodeSigningInfo, kKSTEntitlementAllowed, 1},  // get code-signing information
+      {20, KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kKSTEntitlementAllowed,
+       1},  // invalidate apps without bundles
       {21, nullptr, kKSTEntitlementAllowed, 0},             // set a data container's protection
       {22, nullptr, kKSTEntitlementAllowed, 1},             // recreate the default structure
       {23, nullptr, kKSTEntitlementAllowed, 1},             // measure disk usage
