@@ -6,7 +6,7 @@ packages=(
   cmake ninja-build g++ pkg-config
   libsystemd-dev libplist-dev libspdlog-dev libfmt-dev libacl1-dev libattr1-dev uuid-dev
   libcli11-dev nlohmann-json3-dev
-  googletest libgtest-dev libgmock-dev
+  googletest libgtest-dev libgmock-dev libbenchmark-dev
   acl systemd
 )
 missing=()

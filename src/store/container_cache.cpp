@@ -329,4 +329,11 @@ bool KSTContainerCache::removeContainerForUser(std::uint32_t user, KSTContainerC
   });
 }
 
+void KSTContainerCache::_discardClassMapForUser(std::uint32_t user, KSTContainerClass contentClass,
+                                                bool transient) {
+  std::lock_guard guard(cacheLock_);
+  auto& caches = transient ? transientContainerCache_ : liveContainerCache_;
+  caches.erase(formatMessage("%u-%@", user, KSTContainerClassPath(contentClass)));
+}
+
 }  // namespace kestrel

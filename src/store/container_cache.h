@@ -77,6 +77,11 @@ class KSTContainerCache {
                               std::optional<std::string_view> identifier, bool transient,
                               KSTErrorRef* error);
 
+  // For tests and benchmarks only: forgets the class map of the triple, so the
+  // next call that needs it rebuilds it from the class directory. The daemon
+  // itself never discards a class map.
+  void _discardClassMapForUser(std::uint32_t user, KSTContainerClass contentClass, bool transient);
+
  private:
   KSTContainerCache() = default;
 
