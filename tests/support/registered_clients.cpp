@@ -1,0 +1,56 @@
+#include "support/registered_clients.h"
+
+#include <filesystem>
+
+#include "platform/linux/named_semaphores_linux.h"
+
+namespace kestrel::testing {
+
+namespace fs = std::filesystem;
+
+RegisteredClientsTest::RegisteredClientsTest() {
+  fs::create_directories(scratch.resolve("/etc/kestrel/signatures"));
+  fs::permissions(scratch.resolve("/etc/kestrel"), fs::perms(0755));
+  fs::permissions(scratch.resolve("/etc/kestrel/signatures"), fs::perms(0755));
+  registerClient("allowed-client", "com.example.installer",
+                 "<key>com.zorvane.private.Kestrel.allowed</key><true/>");
+  registerClient("plain-client", "com.example.app", "");
+}
+
+RegisteredClientsTest::~RegisteredClientsTest() {
+  platform::LinuxNamedSemaphores(scratch.root()).remove("kestreld.fb_check");
+}
+
+void RegisteredClientsTest::registerClient(const std::string& name, const std::string& identifier,
+                                           const std::string& entitlements) {
+  const std::string binary = scratch.resolve("/bin/" + name);
+  fs::create_directories(scratch.resolve("/bin"));
+  fs::copy_file(KESTRELCTL_BINARY, binary, fs::copy_options::overwrite_existing);
+  fs::permissions(binary, fs::perms(0755));
+  const std::string plist = "/etc/kestrel/signatures/" + name + ".plist";
+  scratch.writeFile(plist,
+                    "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
+                    "<key>SigningIdentifier</key><string>" +
+                        identifier +
+                        "</string>"
+                        "<key>Executable</key><string>" +
+                        binary +
+                        "</string>"
+                        "<key>Entitlements</key><dict>" +
+                        entitlements +
+                        "</dict>"
+                        "</dict></plist>\n");
+  fs::permissions(scratch.resolve(plist), fs::perms(0644));
+}
+
+ProcessResult RegisteredClientsTest::call(const std::string& client,
+                                          std::vector<std::string> arguments) {
+  arguments.insert(arguments.begin(), {"--root", scratch.path(), "call"});
+  return runProcess(scratch.resolve("/bin/" + client), arguments);
+}
+
+std::string RegisteredClientsTest::log() const {
+  return scratch.readFile("/private/var/root/Library/Logs/Kestrel/kestreld.log");
+}
+
+}  // namespace kestrel::testing
