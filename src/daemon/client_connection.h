@@ -10,9 +10,12 @@
 #include <string>
 #include <vector>
 
+#include <sys/types.h>
+
 #include "daemon/errors.h"
 #include "store/container_class.h"
 #include "store/file_url.h"
+#include "store/metadata.h"
 
 namespace kestrel {
 
@@ -29,7 +32,9 @@ class KSTClientConnection {
   // The one instance for the daemon's own work, made once.
   static KSTClientConnection& sharedClientConnection();
 
-  const std::optional<std::string>& clientBundleIdentifier() const { return clientBundleIdentifier_; }
+  const std::optional<std::string>& clientBundleIdentifier() const {
+    return clientBundleIdentifier_;
+  }
   std::uint32_t clientUserId() const { return clientUserId_; }
   bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
   void setAllowOtherIdLookup(bool allow) { allowOtherIdLookup_ = allow; }
@@ -38,6 +43,29 @@ class KSTClientConnection {
   const std::optional<std::vector<std::string>>& entitledWipeIdentifiers() const {
     return entitledWipeIdentifiers_;
   }
+
+  // Creation and lookup (store/container_creation.cpp). The container of the
+  // identifier, made whole in staging and renamed into its class directory
+  // when it is not there (and createIfNecessary is set); a transient one is
+  // replaced by a fresh one every time. identifier nothing: not a string.
+  // Codes 5, 6, 7, 8, 9, 11, 21 (not logged), 40, 45, 55 and those of the
+  // cache, the metadata writer and the ACLs.
+  KSTMetadataRef createOrLookupContainerForUser(std::uint32_t userId,
+                                                const std::optional<std::string>& identifier,
+                                                bool createIfNecessary,
+                                                KSTContainerClass containerClass, bool transient,
+                                                bool useLocking, std::uint64_t* withError);
+  // Every container of the class for the user (store/container_listing.cpp).
+  std::optional<std::vector<KSTMetadataRef>> containersForUser(std::uint32_t userId,
+                                                               KSTContainerClass withClass,
+                                                               bool transient,
+                                                               std::uint64_t* withError);
+  // The directories creation makes.
+  bool _createDefaultDirectory(const KSTFileURL& url, mode_t mode, uid_t owner, KSTErrorRef* error);
+  bool _createTopLevelContainerDirectory(const KSTFileURL& url, KSTContainerClass containerClass,
+                                         uid_t owner, KSTErrorRef* error);
+  bool _createSubDirectories(const KSTFileURL& url, std::uint32_t userId,
+                             KSTContainerClass containerClass, KSTErrorRef* error);
 
   // Start-up and boot housekeeping of the container store.
   void rebootContainerManagerSetup();
