@@ -9,8 +9,15 @@ namespace kestrel {
 // Whether this build of the daemon serves the row's command.
 bool KSTCommandIsAvailable(const KSTCommandRow& row);
 
+// 0: create or look up a container; 1: list the containers of a class.
+void KSTHandleCreateOrLookupContainer(KSTCommandContext& context);
+void KSTHandleListContainers(KSTCommandContext& context);
+
 // 4: the death-row sweep; replies from its completion.
 void KSTHandleDeleteDeathRow(KSTCommandContext& context);
+
+// 15: a system container's path.
+void KSTHandleSystemContainerPath(KSTCommandContext& context);
 
 // 19: an identifier's code-signing information, as an external request sees it.
 void KSTHandleGetCodeSigningInfo(KSTCommandContext& context);
