@@ -49,6 +49,12 @@ ProcessResult RegisteredClientsTest::call(const std::string& client,
   return runProcess(scratch.resolve("/bin/" + client), arguments);
 }
 
+ProcessResult RegisteredClientsTest::ctl(const std::string& client,
+                                         std::vector<std::string> arguments) {
+  arguments.insert(arguments.begin(), {"--root", scratch.path()});
+  return runProcess(scratch.resolve("/bin/" + client), arguments);
+}
+
 std::string RegisteredClientsTest::log() const {
   return scratch.readFile("/private/var/root/Library/Logs/Kestrel/kestreld.log");
 }

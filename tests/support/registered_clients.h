@@ -25,6 +25,8 @@ class RegisteredClientsTest : public ::testing::Test {
                       const std::string& entitlements);
   // kestrelctl --root <root> call <arguments...>, run as the named client.
   ProcessResult call(const std::string& client, std::vector<std::string> arguments);
+  // kestrelctl --root <root> <arguments...>, run as the named client.
+  ProcessResult ctl(const std::string& client, std::vector<std::string> arguments);
   std::string log() const;
 
   ScratchRoot scratch;

@@ -1,6 +1,11 @@
-// kestrelctl: sends one request to kestreld and prints its reply as JSON.
+// kestrelctl: sends one request to kestreld and prints its reply.
 //
-//   kestrelctl [--root R | --address unix:path=...] call <command> key=type:value ...
+//   kestrelctl [--root R | --address unix:path=...] [--json] [--timeout S] <subcommand> ...
+//
+// The named subcommands (create, lookup, list, sweep, ...) build the request
+// from options and print the reply for people, or as JSON with --json;
+// `call <command> key=type:value ...` sends any request and prints its reply
+// as JSON.
 //
 // Exit status: 0 when the reply's "ReplyError" is 1 (success); 1 when the
 // daemon answered with another code; 2 for a usage error; 3 when the daemon
@@ -10,17 +15,25 @@
 #include <CLI/CLI.hpp>
 #include <cstdio>
 #include <cstdlib>
+#include <fstream>
 #include <iostream>
+#include <iterator>
+#include <optional>
 #include <string>
 #include <vector>
 
 #include "client.h"
+#include "commands.h"
+#include "human_output.h"
 #include "platform/linux/dbus_listener.h"
+#include "platform/plist_serialization.h"
 #include "platform/root.h"
 #include "reply_json.h"
 #include "request_items.h"
 
 namespace {
+
+using namespace kestrel;
 
 constexpr const char* kServiceName = "com.zorvane.kestreld";
 
@@ -34,9 +47,33 @@ enum ExitStatus {
   kExitInternal = 6,
 };
 
+// The exit status of a call that got no reply, its reason printed; nothing
+// when the daemon answered.
+std::optional<int> callFailure(const kestrelctl::CallOutcome& outcome) {
+  switch (outcome.kind) {
+    case kestrelctl::CallOutcome::Kind::Unreachable:
+      std::cerr << "kestrelctl: " << outcome.message << "\n";
+      return kExitUnreachable;
+    case kestrelctl::CallOutcome::Kind::Refused:
+      std::cerr << "kestrelctl: " << outcome.message << "\n";
+      return kExitRefused;
+    case kestrelctl::CallOutcome::Kind::ErrorReply:
+      std::cerr << "kestrelctl: " << outcome.message << "\n";
+      return kExitDBusError;
+    case kestrelctl::CallOutcome::Kind::Reply:
+      break;
+  }
+  return std::nullopt;
+}
+
+void printJson(const platform::MessageDictionary& reply) {
+  std::cout << kestrelctl::replyToJson(reply).dump(2, ' ', false,
+                                                   nlohmann::json::error_handler_t::replace)
+            << "\n";
+}
+
 int runCall(const std::string& address, const std::string& command,
             const std::vector<std::string>& items, std::uint64_t timeoutSeconds) {
-  using namespace kestrel;
   platform::MessageDictionary request;
   std::uint64_t index = 0;
   {
@@ -58,33 +95,120 @@ int runCall(const std::string& address, const std::string& command,
 
   const kestrelctl::CallOutcome outcome =
       kestrelctl::callDaemon(address, kServiceName, request, timeoutSeconds);
-  switch (outcome.kind) {
-    case kestrelctl::CallOutcome::Kind::Unreachable:
-      std::cerr << "kestrelctl: " << outcome.message << "\n";
-      return kExitUnreachable;
-    case kestrelctl::CallOutcome::Kind::Refused:
-      std::cerr << "kestrelctl: " << outcome.message << "\n";
-      return kExitRefused;
-    case kestrelctl::CallOutcome::Kind::ErrorReply:
-      std::cerr << "kestrelctl: " << outcome.message << "\n";
-      return kExitDBusError;
-    case kestrelctl::CallOutcome::Kind::Reply:
-      break;
-  }
-  std::cout << kestrelctl::replyToJson(outcome.reply)
-                   .dump(2, ' ', false, nlohmann::json::error_handler_t::replace)
-            << "\n";
+  if (auto status = callFailure(outcome)) return *status;
+  printJson(outcome.reply);
   const std::uint64_t code = outcome.reply.uint64("ReplyError");
   if (code == 1) return kExitSuccess;
   std::cerr << "kestrelctl: the request failed with error " << code << "\n";
   return kExitReplyError;
 }
 
+// A named subcommand on the command line and what it was given, unparsed.
+struct NamedArguments {
+  CLI::App* app = nullptr;
+  std::string containerClass;
+  std::string user;
+  std::string identifier;
+  bool transient = false;
+  CLI::Option* classOption = nullptr;
+  CLI::Option* userOption = nullptr;
+  CLI::Option* identifierOption = nullptr;
+};
+
+void addNamedOptions(const kestrelctl::SubcommandInfo& info, NamedArguments* arguments) {
+  CLI::App* sub = arguments->app;
+  if (info.takes(kestrelctl::kOptionClass)) {
+    arguments->classOption =
+        sub->add_option("--class", arguments->containerClass,
+                        "Container class: a number, or its name, e.g. Data/Application")
+            ->required();
+  }
+  if (info.takes(kestrelctl::kOptionUser)) {
+    arguments->userOption =
+        sub->add_option("--user", arguments->user, "User id (1: the current mobile user)")
+            ->required();
+  }
+  if (info.takes(kestrelctl::kOptionIdentifier)) {
+    arguments->identifierOption = sub->add_option(
+        "--identifier", arguments->identifier, "Container identifier (default: the caller's own)");
+  }
+  if (info.takes(kestrelctl::kOptionIdentifierRequired)) {
+    arguments->identifierOption =
+        sub->add_option("--identifier", arguments->identifier, "Identifier to look up")->required();
+  }
+  if (info.takes(kestrelctl::kOptionTransient)) {
+    sub->add_flag("--transient", arguments->transient, "The transient variant of the class");
+  }
+}
+
+int runNamed(const std::string& address, const kestrelctl::SubcommandInfo& info,
+             const NamedArguments& arguments, bool json, std::uint64_t timeoutSeconds) {
+  kestrelctl::RequestOptions options;
+  std::string error;
+  if (arguments.classOption && arguments.classOption->count() > 0) {
+    options.containerClass = kestrelctl::parseContainerClass(arguments.containerClass, &error);
+  }
+  if (error.empty() && arguments.userOption && arguments.userOption->count() > 0) {
+    options.userId = kestrelctl::parseUnsignedOption("--user", arguments.user, &error);
+  }
+  if (arguments.identifierOption && arguments.identifierOption->count() > 0) {
+    options.identifier = arguments.identifier;
+  }
+  options.transient = arguments.transient;
+
+  platform::MessageDictionary request;
+  if (!error.empty() || !kestrelctl::buildRequest(info, options, &request, &error)) {
+    std::cerr << "kestrelctl: " << info.name << ": " << error << "\n";
+    return kExitUsage;
+  }
+
+  const kestrelctl::CallOutcome outcome =
+      kestrelctl::callDaemon(address, kServiceName, request, timeoutSeconds);
+  if (auto status = callFailure(outcome)) return *status;
+  if (json) printJson(outcome.reply);
+  const std::uint64_t code = outcome.reply.uint64("ReplyError");
+  if (code != 1) {
+    std::cerr << kestrelctl::failureMessage(info.name, code) << "\n";
+    return kExitReplyError;
+  }
+  if (!json) std::cout << kestrelctl::renderReply(info.subcommand, outcome.reply);
+  return kExitSuccess;
+}
+
+// Prints a property-list file (a metadata file, the code-signing mapping, a
+// journal) as JSON. Works on the files alone; the daemon is not asked.
+int runPlist(const std::string& file) {
+  std::ifstream in(file, std::ios::binary);
+  if (!in) {
+    std::cerr << "kestrelctl: cannot open " << file << "\n";
+    return kExitReplyError;
+  }
+  const std::vector<std::uint8_t> bytes((std::istreambuf_iterator<char>(in)),
+                                        std::istreambuf_iterator<char>());
+  std::string error;
+  const std::optional<PlistValue> value = platform::parsePropertyList(bytes, &error);
+  const PlistDictionary* dictionary = value ? value->dictionary() : nullptr;
+  std::optional<platform::MessageDictionary> message;
+  if (dictionary != nullptr) message = platform::MessageDictionary::fromPlist(*dictionary);
+  if (!message) {
+    std::cerr << "kestrelctl: " << file << " is not a property-list dictionary"
+              << (error.empty() ? "" : ": " + error) << "\n";
+    return kExitReplyError;
+  }
+  printJson(*message);
+  return kExitSuccess;
+}
+
 int run(int argc, char** argv) {
-  CLI::App app{"Send a request to kestreld and print its reply as JSON."};
+  CLI::App app{"Send a request to kestreld and print its reply."};
   app.footer(
-      "Item types: u64, i64, bool, str, uuid, data (hex), plist (a JSON value).\n"
-      "Example: kestrelctl call 0 ContainerClass=u64:2 UserID=u64:501 "
+      "Classes: 1..13 or Bundle/Application, Data/Application, Bundle/VantlerPlugin,\n"
+      "Data/VantlerPlugin, Bundle/VPNPlugin, Data/VPNPlugin, Shared/AppGroup, Bundle/Framework,\n"
+      "Data/VexelService, Data/InternalDaemon, Data/TempDir, Data/System, Shared/SystemGroup.\n"
+      "call item types: u64, i64, bool, str, uuid, data (hex), plist (a JSON value).\n"
+      "Examples: kestrelctl create --class Data/Application --user 501 "
+      "--identifier com.example.app\n"
+      "          kestrelctl call 0 ContainerClass=u64:2 UserID=u64:501 "
       "Identifier=str:com.example.app\n"
       "Exit status: 0 success (ReplyError 1), 1 other ReplyError, 2 usage, 3 unreachable,\n"
       "4 connection closed without a reply (refused), 5 D-Bus error reply, 6 internal failure.");
@@ -92,20 +216,38 @@ int run(int argc, char** argv) {
 
   std::string root;
   std::string address;
+  bool json = false;
+  std::uint64_t timeoutSeconds = 120;
   auto* rootOption =
       app.add_option("--root", root, "Filesystem root of the daemon (default: $KESTREL_ROOT or /)");
   app.add_option("--address", address,
                  "D-Bus address, e.g. unix:path=/run/kestrel/com.zorvane.kestreld")
       ->excludes(rootOption);
+  app.add_flag("--json", json, "Print the reply as JSON (call always does)");
+  app.add_option("--timeout", timeoutSeconds, "Seconds to wait for the reply; 0 waits for ever")
+      ->capture_default_str();
 
   std::string command;
   std::vector<std::string> items;
-  std::uint64_t timeoutSeconds = 120;
   CLI::App* call = app.add_subcommand("call", "Send one request");
   call->add_option("command", command, "Command index (uint64)")->required();
   call->add_option("items", items, "Request keys: key=type:value");
   call->add_option("--timeout", timeoutSeconds, "Seconds to wait for the reply; 0 waits for ever")
       ->capture_default_str();
+
+  std::string plistFile;
+  CLI::App* plist =
+      app.add_subcommand("plist", "Print a property-list file (e.g. a metadata file) as JSON");
+  plist->add_option("file", plistFile, "The file")->required();
+
+  // Sized up front: the options keep pointers into their entries.
+  std::vector<NamedArguments> named(kestrelctl::subcommands().size());
+  for (std::size_t i = 0; i < named.size(); ++i) {
+    const kestrelctl::SubcommandInfo& info = kestrelctl::subcommands()[i];
+    named[i].app = app.add_subcommand(std::string(info.name), std::string(info.summary));
+    named[i].app->fallthrough();  // the global options may also follow the subcommand
+    addNamedOptions(info, &named[i]);
+  }
 
   try {
     app.parse(argc, argv);
@@ -114,12 +256,16 @@ int run(int argc, char** argv) {
     return status == 0 ? 0 : kExitUsage;
   }
 
+  if (plist->parsed()) return runPlist(plistFile);
   if (address.empty()) {
-    const kestrel::platform::FilesystemRoot filesystemRoot =
-        root.empty() ? kestrel::platform::FilesystemRoot::fromEnvironment()
-                     : kestrel::platform::FilesystemRoot(root);
-    address =
-        "unix:path=" + kestrel::platform::messageServiceSocketPath(filesystemRoot, kServiceName);
+    const platform::FilesystemRoot filesystemRoot =
+        root.empty() ? platform::FilesystemRoot::fromEnvironment() : platform::FilesystemRoot(root);
+    address = "unix:path=" + platform::messageServiceSocketPath(filesystemRoot, kServiceName);
+  }
+  for (std::size_t i = 0; i < named.size(); ++i) {
+    if (named[i].app->parsed()) {
+      return runNamed(address, kestrelctl::subcommands()[i], named[i], json, timeoutSeconds);
+    }
   }
   return runCall(address, command, items, timeoutSeconds);
 }

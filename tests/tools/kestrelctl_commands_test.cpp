@@ -1,0 +1,148 @@
+// kestrelctl's named subcommands: option parsing and the requests they send.
+#include "kestrelctl/commands.h"
+
+#include <gtest/gtest.h>
+
+#include "store/container_class.h"
+
+namespace kestrel::kestrelctl {
+namespace {
+
+TEST(KestrelctlCommandsTest, ClassNamesMatchTheDaemonsClassPaths) {
+  ASSERT_EQ(containerClassNames().size(), 13u);
+  for (std::uint64_t c = 1; c <= 13; ++c) {
+    SCOPED_TRACE(c);
+    EXPECT_EQ(containerClassNames()[c - 1], KSTContainerClassPath(c));
+    std::string error;
+    EXPECT_EQ(parseContainerClass(KSTContainerClassPath(c), &error), c) << error;
+  }
+}
+
+TEST(KestrelctlCommandsTest, ParsesClassesAndUserIds) {
+  struct Row {
+    const char* text;
+    std::optional<std::uint64_t> containerClass;
+    const char* errorPart;  // when no class
+  };
+  const Row rows[] = {
+      {"2", 2, ""},
+      {"0", 0, ""},  // bounds go to the daemon, which answers for them
+      {"14", 14, ""},
+      {"18446744073709551615", UINT64_MAX, ""},
+      {"data/application", 2, ""},
+      {"SHARED/SYSTEMGROUP", 13, ""},
+      {"18446744073709551616", std::nullopt, "not a number between 0 and 18446744073709551615"},
+      {"-1", std::nullopt, "\"-1\" is not a number"},
+      {"+2", std::nullopt, "not a number"},
+      {"2x", std::nullopt, "not a number"},
+      {"Data/Applications", std::nullopt, "unknown container class \"Data/Applications\""},
+      {"Application", std::nullopt, "Bundle/Application, Data/Application"},
+      {"", std::nullopt, "unknown container class"},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.text);
+    std::string error;
+    EXPECT_EQ(parseContainerClass(row.text, &error), row.containerClass);
+    if (!row.containerClass) {
+      EXPECT_NE(error.find("--class"), std::string::npos) << error;
+      EXPECT_NE(error.find(row.errorPart), std::string::npos) << error;
+    }
+  }
+
+  std::string error;
+  EXPECT_EQ(parseUnsignedOption("--user", "501", &error), 501u);
+  EXPECT_EQ(parseUnsignedOption("--user", " 501", &error), std::nullopt);
+  EXPECT_EQ(parseUnsignedOption("--user", "0x1f5", &error), std::nullopt);
+  EXPECT_EQ(parseUnsignedOption("--user", "-501", &error), std::nullopt);
+  EXPECT_EQ(error, "--user: \"-501\" is not a number between 0 and 18446744073709551615");
+}
+
+// The request as "key=type:value" items in key order, for comparing whole requests.
+std::string describe(const platform::MessageDictionary& request) {
+  std::string out;
+  for (const auto& [key, value] : request.entries()) {
+    out += out.empty() ? "" : " ";
+    out += key + "=";
+    if (auto u = value.uint64()) {
+      out += "u64:" + std::to_string(*u);
+    } else if (auto b = value.boolean()) {
+      out += std::string("bool:") + (*b ? "true" : "false");
+    } else if (const std::string* s = value.string()) {
+      out += "str:" + *s;
+    } else {
+      out += "?";
+    }
+  }
+  return out;
+}
+
+TEST(KestrelctlCommandsTest, BuildsTheRequestOfEachSubcommand) {
+  RequestOptions full;
+  full.containerClass = 2;
+  full.userId = 501;
+  full.identifier = "com.example.app";
+  full.transient = true;
+  RequestOptions noIdentifier = full;
+  noIdentifier.identifier.reset();
+  noIdentifier.transient = false;
+
+  struct Row {
+    Subcommand subcommand;
+    const RequestOptions& options;
+    const char* request;
+  };
+  const Row rows[] = {
+      {Subcommand::Create, full,
+       "Command=u64:0 ContainerClass=u64:2 CreateIfNecessary=bool:true "
+       "Identifier=str:com.example.app Transient=bool:true UserID=u64:501"},
+      {Subcommand::Create, noIdentifier,
+       "Command=u64:0 ContainerClass=u64:2 CreateIfNecessary=bool:true Transient=bool:false "
+       "UserID=u64:501"},
+      {Subcommand::Lookup, full,
+       "Command=u64:0 ContainerClass=u64:2 CreateIfNecessary=bool:false "
+       "Identifier=str:com.example.app Transient=bool:true UserID=u64:501"},
+      {Subcommand::List, full,
+       "Command=u64:1 ContainerClass=u64:2 Transient=bool:true UserID=u64:501"},
+      {Subcommand::Sweep, full, "Command=u64:4"},
+      {Subcommand::SystemContainer, full, "Command=u64:15 Identifier=str:com.example.app"},
+      {Subcommand::SystemContainer, noIdentifier, "Command=u64:15"},
+      {Subcommand::CodeSigningInfo, full, "Command=u64:19 Identifier=str:com.example.app"},
+      {Subcommand::InvalidateCodeSigning, full, "Command=u64:20"},
+  };
+  for (const Row& row : rows) {
+    const SubcommandInfo& info = subcommandInfo(row.subcommand);
+    SCOPED_TRACE(std::string(info.name) + " " + row.request);
+    platform::MessageDictionary request;
+    std::string error;
+    ASSERT_TRUE(buildRequest(info, row.options, &request, &error)) << error;
+    EXPECT_EQ(describe(request), row.request);
+  }
+}
+
+TEST(KestrelctlCommandsTest, MissingRequiredOptionsAreRefused) {
+  RequestOptions noClass;
+  noClass.userId = 501;
+  RequestOptions noUser;
+  noUser.containerClass = 2;
+  struct Row {
+    Subcommand subcommand;
+    const RequestOptions& options;
+    const char* error;
+  };
+  const Row rows[] = {
+      {Subcommand::Create, noClass, "--class is required"},
+      {Subcommand::Lookup, noUser, "--user is required"},
+      {Subcommand::List, noClass, "--class is required"},
+      {Subcommand::CodeSigningInfo, noClass, "--identifier is required"},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.error);
+    platform::MessageDictionary request;
+    std::string error;
+    EXPECT_FALSE(buildRequest(subcommandInfo(row.subcommand), row.options, &request, &error));
+    EXPECT_EQ(error, row.error);
+  }
+}
+
+}  // namespace
+}  // namespace kestrel::kestrelctl
