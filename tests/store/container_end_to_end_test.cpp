@@ -1,0 +1,84 @@
+// Commands 0, 1 and 15 through the real daemon, from clients of different
+// identities and rights.
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <string>
+
+#include "support/registered_clients.h"
+
+namespace kestrel {
+namespace {
+
+namespace fs = std::filesystem;
+
+// The value of a "name  value" line of kestrelctl's output for people.
+std::string fact(const std::string& output, const std::string& name) {
+  const std::size_t at = output.find(name + " ");
+  if (at == std::string::npos) return {};
+  const std::size_t start = output.find_first_not_of(' ', at + name.size());
+  return output.substr(start, output.find('\n', start) - start);
+}
+
+class ContainerEndToEndTest : public testing::RegisteredClientsTest {
+ protected:
+  ContainerEndToEndTest() {
+    registerClient("app-client", "com.example.app",
+                   "<key>com.zorvane.private.Kestrel.none</key><true/>");
+  }
+};
+
+TEST_F(ContainerEndToEndTest, AppGetsItsOwnDataContainerAndTheInstallerListsIt) {
+  testing::DaemonProcess daemon(scratch.path());
+  ASSERT_TRUE(daemon.ready());
+
+  // No identifier: the client's own.
+  auto made = ctl("app-client", {"create", "--class", "Data/Application", "--user", "501"});
+  ASSERT_EQ(made.exitStatus, 0) << made.output;
+  EXPECT_EQ(fact(made.output, "identifier"), "com.example.app");
+  EXPECT_EQ(fact(made.output, "existed"), "no");
+  const std::string path = fact(made.output, "path");
+  EXPECT_TRUE(fs::exists(path + "/.com.zorvane.kestrel.metadata.plist")) << made.output;
+  EXPECT_TRUE(fs::is_directory(path + "/Library/Preferences"));
+
+  auto again = ctl("app-client", {"lookup", "--class", "2", "--user", "1"});
+  ASSERT_EQ(again.exitStatus, 0) << again.output;
+  EXPECT_EQ(fact(again.output, "existed"), "yes");
+  EXPECT_EQ(fact(again.output, "path"), path);
+  EXPECT_EQ(fact(again.output, "uuid"), fact(made.output, "uuid"));
+
+  // Listing needs "allowed"; the installer has it.
+  EXPECT_EQ(ctl("app-client", {"list", "--class", "2", "--user", "501"}).exitStatus, 4);
+  auto listed = ctl("allowed-client", {"--json", "list", "--class", "2", "--user", "501"});
+  ASSERT_EQ(listed.exitStatus, 0) << listed.output;
+  EXPECT_NE(listed.output.find("\"com.example.app\""), std::string::npos) << listed.output;
+  EXPECT_NE(listed.output.find(fact(made.output, "uuid")), std::string::npos) << listed.output;
+
+  // A program nobody registered has no entitlements at all: refused. A bad user is 38.
+  fs::copy_file(KESTRELCTL_BINARY, scratch.resolve("/bin/stranger"));
+  EXPECT_EQ(ctl("stranger", {"create", "--class", "2", "--user", "501"}).exitStatus, 4);
+  auto badUser = ctl("app-client", {"create", "--class", "Bundle/Application", "--user", "501"});
+  EXPECT_EQ(badUser.exitStatus, 1);
+  EXPECT_NE(badUser.output.find("error 38"), std::string::npos) << badUser.output;
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
+TEST_F(ContainerEndToEndTest, SystemContainersOfWellKnownIdsButNotOfUnentitledOwners) {
+  testing::DaemonProcess daemon(scratch.path());
+  ASSERT_TRUE(daemon.ready());
+
+  auto known = ctl("app-client", {"system-container", "--identifier", "com.zorvane.egretd"});
+  ASSERT_EQ(known.exitStatus, 0) << known.output;
+  EXPECT_EQ(fact(known.output, "path"),
+            scratch.resolve("/private/var/containers/Data/System/com.zorvane.egretd"));
+
+  // Its own system container needs the entitlement, which it does not have.
+  auto own = ctl("app-client", {"system-container"});
+  EXPECT_EQ(own.exitStatus, 1);
+  EXPECT_NE(own.output.find("error 55"), std::string::npos) << own.output;
+  EXPECT_NE(log().find("com.example.app not entitled for a system container"), std::string::npos);
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
+}  // namespace
+}  // namespace kestrel
