@@ -1,6 +1,7 @@
 #!/usr/bin/env bash
 # Builds kestreld and runs it on a fresh scratch root, so that nothing of the
-# host is touched. Stop it with Ctrl-C (or kill -TERM <pid>). Without a
+# host is touched, and shows a short session: a container created, looked up
+# again, listed, its directory and metadata file. Stop it with Ctrl-C (or kill -TERM <pid>). Without a
 # terminal (CI) it shows that it is up and stops again.
 set -euo pipefail
 cd "$(dirname "$0")/.."
@@ -41,8 +42,23 @@ kestreld is up (pid $pid)
   upcall socket:  $upcall
   stop it with:   Ctrl-C, or kill -TERM $pid
 INFO
-echo "--- a request: kestrelctl --root $root call 25 UserID=u64:501"
-"$ctl" --root "$root" call 25 UserID=u64:501
+k() {
+  echo "\$ kestrelctl $*"
+  "$ctl" --root "$root" "$@"
+  echo
+}
+k create --class Data/Application --user 501 --identifier com.example.app
+k lookup --class Data/Application --user 501 --identifier com.example.app
+k create --class Data/Application --user 501 --identifier com.example.notes
+k list --class Data/Application --user 501
+path=$("$ctl" --root "$root" --json lookup --class 2 --user 501 --identifier com.example.app |
+  sed -n 's/^ *"ReplyPath": "\(.*\)",*$/\1/p')
+echo "\$ ls -lan $path"
+ls -lan "$path"
+echo
+k plist "$path/.com.zorvane.kestrel.metadata.plist"
+k system-container --identifier com.zorvane.egretd
+k sweep
 echo "--- $log"
 cat "$log"
 if [[ -t 0 ]]; then
