@@ -13,6 +13,7 @@
 #include <sys/types.h>
 
 #include "daemon/errors.h"
+#include "platform/uuid.h"
 #include "store/container_class.h"
 #include "store/file_url.h"
 #include "store/metadata.h"
@@ -66,6 +67,23 @@ class KSTClientConnection {
                                          uid_t owner, KSTErrorRef* error);
   bool _createSubDirectories(const KSTFileURL& url, std::uint32_t userId,
                              KSTContainerClass containerClass, KSTErrorRef* error);
+
+  // Deletion (operations/container_deletion.cpp). Stage-for-delete renames
+  // each container named by entry i of the arrays into death row and drops
+  // its sandbox mapping and cache entry (and, for bundles, its code-signing
+  // entries); entries of the wrong type are nothing and are skipped with a
+  // log line. It never starts a sweep. The code is written only on failure.
+  void stageForDeleteContainersWithUsers(
+      const std::vector<std::uint32_t>& users,
+      const std::vector<std::optional<platform::Uuid>>& UUIDs,
+      const std::optional<std::vector<std::optional<std::string>>>& identifiers,
+      const std::vector<std::optional<KSTContainerClass>>& classes, bool useLocking,
+      std::uint64_t* withError);
+  // Looks the container up (without creating it) and stages it for deletion.
+  void deleteContainerForUser(std::uint32_t userId,
+                              const std::optional<std::string>& withIdentifier,
+                              KSTContainerClass containerClass, bool transient,
+                              std::uint64_t* withError);
 
   // Start-up and boot housekeeping of the container store.
   void rebootContainerManagerSetup();
