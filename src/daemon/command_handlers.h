@@ -13,12 +13,27 @@ bool KSTCommandIsAvailable(const KSTCommandRow& row);
 void KSTHandleCreateOrLookupContainer(KSTCommandContext& context);
 void KSTHandleListContainers(KSTCommandContext& context);
 
+// 3: stages a batch of containers for deletion; 10: deletes one container.
+void KSTHandleStageForDelete(KSTCommandContext& context);
+void KSTHandleDeleteContainer(KSTCommandContext& context);
+
 // 4: the death-row sweep; replies from its completion.
 void KSTHandleDeleteDeathRow(KSTCommandContext& context);
+
+// 13: the app-group container paths of an identifier; 14: its app-group ids.
+void KSTHandleAppGroupContainerPaths(KSTCommandContext& context);
+void KSTHandleAppGroupIdentifiers(KSTCommandContext& context);
 
 // 15: a system container's path.
 void KSTHandleSystemContainerPath(KSTCommandContext& context);
 
+// 16: the system group container paths of an identifier; 17: one system group
+// container's path.
+void KSTHandleSystemGroupContainerPaths(KSTCommandContext& context);
+void KSTHandleSystemGroupContainerPath(KSTCommandContext& context);
+
+// 18: processes new code-signing information (none: removal) for an identifier.
+void KSTHandleProcessCodeSigningInfo(KSTCommandContext& context);
 // 19: an identifier's code-signing information, as an external request sees it.
 void KSTHandleGetCodeSigningInfo(KSTCommandContext& context);
 // 20: invalidates the code-signing information of apps without a bundle container.

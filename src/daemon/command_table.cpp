@@ -8,25 +8,30 @@ namespace kestrel {
 const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
   static const std::array<KSTCommandRow, kKSTCommandCount> table = {{
       {0, KSTHandleCreateOrLookupContainer, kKSTEntitlementNone,
-       1},                                                      // create or look up a container
-      {1, KSTHandleListContainers, kKSTEntitlementAllowed, 1},  // list the containers of a class
-      {2, nullptr, kKSTEntitlementAllowed, 1},                  // replace a container by another
-      {3, nullptr, kKSTEntitlementAllowed, 1},                  // stage containers for deletion
-      {4, KSTHandleDeleteDeathRow, kKSTEntitlementAllowed, 0},  // destroy what is on death row
-      {5, nullptr, kKSTEntitlementAllowed, 1},                  // set an info value
-      {6, nullptr, kKSTEntitlementAllowed, 1},                  // get an info value
-      {7, nullptr, kKSTEntitlementAllowed, 1},                  // get a container's metadata
-      {8, nullptr, kKSTEntitlementAllowed, 1},                  // recreate the default structure
-      {9, nullptr, kKSTEntitlementAllowed, 1},                  // give a container a new UUID
-      {10, nullptr, kKSTEntitlementAllowed, 1},                 // delete a container
-      {11, nullptr, kKSTEntitlementWipeContainer, 1},           // wipe a plug-in data container
-      {12, nullptr, kKSTEntitlementAllowed, 1},                 // delete a data container's content
-      {13, nullptr, kKSTEntitlementNone, 1},                    // the client's app-group paths
-      {14, nullptr, kKSTEntitlementAllowed, 1},                 // an identifier's app-group ids
+       1},                                                        // create or look up a container
+      {1, KSTHandleListContainers, kKSTEntitlementAllowed, 1},    // list the containers of a class
+      {2, nullptr, kKSTEntitlementAllowed, 1},                    // replace a container by another
+      {3, KSTHandleStageForDelete, kKSTEntitlementAllowed, 1},    // stage containers for deletion
+      {4, KSTHandleDeleteDeathRow, kKSTEntitlementAllowed, 0},    // destroy what is on death row
+      {5, nullptr, kKSTEntitlementAllowed, 1},                    // set an info value
+      {6, nullptr, kKSTEntitlementAllowed, 1},                    // get an info value
+      {7, nullptr, kKSTEntitlementAllowed, 1},                    // get a container's metadata
+      {8, nullptr, kKSTEntitlementAllowed, 1},                    // recreate the default structure
+      {9, nullptr, kKSTEntitlementAllowed, 1},                    // give a container a new UUID
+      {10, KSTHandleDeleteContainer, kKSTEntitlementAllowed, 1},  // delete a container
+      {11, nullptr, kKSTEntitlementWipeContainer, 1},             // wipe a plug-in data container
+      {12, nullptr, kKSTEntitlementAllowed, 1},  // delete a data container's content
+      {13, KSTHandleAppGroupContainerPaths, kKSTEntitlementNone,
+       1},  // the client's app-group paths
+      {14, KSTHandleAppGroupIdentifiers, kKSTEntitlementAllowed,
+       1},                                                         // an identifier's app-group ids
       {15, KSTHandleSystemContainerPath, kKSTEntitlementNone, 1},  // a system container's path
-      {16, nullptr, kKSTEntitlementNone, 1},                       // system group container paths
-      {17, nullptr, kKSTEntitlementNone, 1},     // one system group container's path
-      {18, nullptr, kKSTEntitlementAllowed, 1},  // process code-signing information
+      {16, KSTHandleSystemGroupContainerPaths, kKSTEntitlementNone,
+       1},  // system group container paths
+      {17, KSTHandleSystemGroupContainerPath, kKSTEntitlementNone,
+       1},                                       // one system group container's path
+      {18, nullptr, kKSTEntitlementAllowed,
+       1},  // process code-signing information
       {19, KSTHandleGetCodeSigningInfo, kKSTEntitlementAllowed, 1},  // get code-signing information
       {20, KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kKSTEntitlementAllowed,
        1},                                                  // invalidate apps without bundles
