@@ -1,0 +1,312 @@
+// Request benchmark: latency and throughput of a running kestreld, each
+// figure beside a floor measured in the same run.
+//
+//   lookups   command 0 (no creation) of existing containers, with 1, 2 and 8
+//             client connections, against org.freedesktop.DBus.Peer.Ping on
+//             the same kind of connection to the same daemon;
+//   creation  command 0 of new identifiers, against a baseline that makes the
+//             same directories, metadata file (written, synced, renamed),
+//             owners and final rename in-process, without the daemon.
+//
+//   kestrel_request_bench --address unix:path=... --root R --out DIR [--seconds S]
+//
+// Writes DIR/request_bench.json (figures and ratios) and DIR/latencies.csv
+// (phase, clients, microseconds; one line a request) for plotting. The
+// caller (bench/request.sh) starts the daemon and registers this binary as a
+// client with the "allowed" entitlement.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <iostream>
+#include <memory>
+#include <nlohmann/json.hpp>
+#include <random>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "daemon_connection.h"
+#include "platform/message_ipc.h"
+#include "platform/plist.h"
+#include "platform/plist_serialization.h"
+#include "platform/unique_fd.h"
+#include "platform/uuid.h"
+
+namespace {
+
+using Clock = std::chrono::steady_clock;
+namespace fs = std::filesystem;
+using kestrel::platform::MessageDictionary;
+
+constexpr std::uint64_t kUser = 501;
+constexpr std::uint64_t kClass = 2;  // Data/Application
+constexpr std::size_t kPopulation = 1000;
+constexpr std::size_t kCreations = 400;
+
+using Connection = kestrel::bench::DaemonConnection;
+
+MessageDictionary containerRequest(const std::string& identifier, bool create) {
+  MessageDictionary request;
+  request.setUint64("Command", 0);
+  request.setUint64("ContainerClass", kClass);
+  request.setUint64("UserID", kUser);
+  request.setString("Identifier", identifier);
+  request.setBoolean("CreateIfNecessary", create);
+  return request;
+}
+
+std::string identifierFor(const char* prefix, std::size_t index) {
+  return std::string(prefix) + std::to_string(index);
+}
+
+struct Phase {
+  std::string name;
+  int clients = 1;
+  std::vector<double> micros;  // one entry a request
+  double seconds = 0;          // wall time of the phase
+
+  double percentile(double p) const {
+    if (micros.empty()) return 0;
+    std::vector<double> sorted = micros;
+    std::sort(sorted.begin(), sorted.end());
+    const auto at = static_cast<std::size_t>(p * static_cast<double>(sorted.size() - 1));
+    return sorted[at];
+  }
+  double throughput() const {
+    return seconds > 0 ? static_cast<double>(micros.size()) / seconds : 0;
+  }
+};
+
+// Runs body(connection, random) on `clients` threads, each with its own
+// connection, for the given time; every call of body is one timed request.
+template <typename Body>
+Phase runTimed(const std::string& name, const std::string& address, int clients, double seconds,
+               Body body) {
+  std::vector<std::vector<double>> perThread(clients);
+  std::atomic<bool> stop{false};
+  std::atomic<int> ready{0};
+  std::vector<std::thread> threads;
+  for (int t = 0; t < clients; ++t) {
+    threads.emplace_back([&, t] {
+      Connection connection(address);
+      std::mt19937_64 random(static_cast<std::uint64_t>(t) * 7919 + 1);
+      body(connection, random);  // warm-up, not counted
+      ready.fetch_add(1);
+      while (ready.load() < clients) std::this_thread::yield();
+      while (!stop.load(std::memory_order_relaxed)) {
+        const auto start = Clock::now();
+        body(connection, random);
+        perThread[t].push_back(
+            std::chrono::duration<double, std::micro>(Clock::now() - start).count());
+      }
+    });
+  }
+  while (ready.load() < clients) std::this_thread::sleep_for(std::chrono::milliseconds(1));
+  const auto start = Clock::now();
+  std::this_thread::sleep_for(std::chrono::duration<double>(seconds));
+  stop.store(true);
+  for (auto& thread : threads) thread.join();
+  Phase phase{name, clients, {}, std::chrono::duration<double>(Clock::now() - start).count()};
+  for (auto& v : perThread) phase.micros.insert(phase.micros.end(), v.begin(), v.end());
+  return phase;
+}
+
+// The same system calls as a creation, without the daemon: the staging
+// directory and its five sub-directories with owners, the metadata file
+// written, synced and renamed into place (and its directory synced), and the
+// rename into the class directory.
+class SyscallBaseline {
+ public:
+  explicit SyscallBaseline(const std::string& root)
+      : staging_(root + "/bench-baseline/Staging"), live_(root + "/bench-baseline/Live") {
+    fs::create_directories(staging_);
+    fs::create_directories(live_);
+  }
+
+  void createOne(std::size_t index) {
+    const std::string name = kestrel::platform::Uuid::random().string();
+    const std::string top = staging_ + "/" + name;
+    mkdirOwned(top);
+    kestrel::PlistDictionary metadata{
+        {"KSTMetadataIdentifier",
+         kestrel::PlistValue(identifierFor("com.example.baseline.", index))},
+        {"KSTMetadataUUID", kestrel::PlistValue(kestrel::platform::Uuid::random().string())},
+        {"KSTMetadataContentClass", kestrel::PlistValue(std::uint64_t{kClass})},
+        {"KSTMetadataPersona", kestrel::PlistValue(std::uint64_t{kUser})}};
+    const auto bytes = kestrel::platform::serializeBinaryPropertyList(
+        kestrel::PlistValue(std::move(metadata)), nullptr);
+    writeAtomically(top + "/.com.zorvane.kestrel.metadata.plist", *bytes);
+    for (const char* sub :
+         {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"}) {
+      mkdirOwned(top + "/" + sub);
+    }
+    if (::rename(top.c_str(), (live_ + "/" + name).c_str()) != 0)
+      throw std::runtime_error("rename");
+  }
+
+ private:
+  static void mkdirOwned(const std::string& path) {
+    if (::mkdir(path.c_str(), 0755) != 0 || ::chown(path.c_str(), kUser, kUser) != 0) {
+      throw std::runtime_error("mkdir " + path);
+    }
+  }
+  static void writeAtomically(const std::string& path, const std::vector<std::uint8_t>& bytes) {
+    const std::string temporary = path + ".tmp";
+    kestrel::platform::UniqueFd fd(
+        ::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0644));
+    if (!fd ||
+        ::write(fd.get(), bytes.data(), bytes.size()) != static_cast<ssize_t>(bytes.size()) ||
+        ::fsync(fd.get()) != 0 || ::rename(temporary.c_str(), path.c_str()) != 0) {
+      throw std::runtime_error("write " + path);
+    }
+    const std::string parent = fs::path(path).parent_path();
+    kestrel::platform::UniqueFd directory(
+        ::open(parent.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (directory) ::fsync(directory.get());
+  }
+
+  std::string staging_;
+  std::string live_;
+};
+
+Phase timedLoop(const std::string& name, std::size_t count,
+                const std::function<void(std::size_t)>& body) {
+  Phase phase{name, 1, {}, 0};
+  const auto start = Clock::now();
+  for (std::size_t i = 0; i < count; ++i) {
+    const auto t0 = Clock::now();
+    body(i);
+    phase.micros.push_back(std::chrono::duration<double, std::micro>(Clock::now() - t0).count());
+  }
+  phase.seconds = std::chrono::duration<double>(Clock::now() - start).count();
+  return phase;
+}
+
+int run(int argc, char** argv) {
+  std::string address, root, out;
+  double seconds = 3;
+  for (int i = 1; i + 1 < argc; i += 2) {
+    const std::string option = argv[i];
+    if (option == "--address")
+      address = argv[i + 1];
+    else if (option == "--root")
+      root = argv[i + 1];
+    else if (option == "--out")
+      out = argv[i + 1];
+    else if (option == "--seconds")
+      seconds = std::stod(argv[i + 1]);
+  }
+  if (address.empty() || root.empty() || out.empty()) {
+    std::cerr << "usage: kestrel_request_bench --address A --root R --out DIR [--seconds S]\n";
+    return 2;
+  }
+
+  // The containers the lookups find.
+  {
+    Connection connection(address);
+    for (std::size_t i = 0; i < kPopulation; ++i) {
+      if (connection.request(containerRequest(identifierFor("com.example.bench.", i), true)) != 1) {
+        std::cerr << "could not create the population\n";
+        return 1;
+      }
+    }
+  }
+
+  std::vector<Phase> phases;
+  for (int clients : {1, 2, 8}) {
+    phases.push_back(runTimed("ping", address, clients, seconds,
+                              [](Connection& c, std::mt19937_64&) { c.ping(); }));
+    phases.push_back(
+        runTimed("lookup", address, clients, seconds, [](Connection& c, std::mt19937_64& random) {
+          const std::size_t i = random() % kPopulation;
+          if (c.request(containerRequest(identifierFor("com.example.bench.", i), false)) != 1) {
+            throw std::runtime_error("lookup failed");
+          }
+        }));
+  }
+  {
+    Connection connection(address);
+    phases.push_back(timedLoop("create", kCreations, [&](std::size_t i) {
+      if (connection.request(containerRequest(identifierFor("com.example.new.", i), true)) != 1) {
+        throw std::runtime_error("creation failed");
+      }
+    }));
+    SyscallBaseline baseline(root);
+    phases.push_back(
+        timedLoop("create-syscalls", kCreations, [&](std::size_t i) { baseline.createOne(i); }));
+  }
+
+  fs::create_directories(out);
+  std::ofstream csv(out + "/latencies.csv");
+  csv << "phase,clients,micros\n";
+  nlohmann::json result;
+  result["population"] = kPopulation;
+  result["seconds_per_phase"] = seconds;
+  auto find = [&](const std::string& name, int clients) -> const Phase& {
+    for (const Phase& p : phases) {
+      if (p.name == name && p.clients == clients) return p;
+    }
+    throw std::runtime_error("no phase " + name);
+  };
+  for (const Phase& p : phases) {
+    for (double v : p.micros) csv << p.name << "," << p.clients << "," << v << "\n";
+    result["phases"].push_back({{"phase", p.name},
+                                {"clients", p.clients},
+                                {"requests", p.micros.size()},
+                                {"p50_us", p.percentile(0.5)},
+                                {"p90_us", p.percentile(0.9)},
+                                {"p99_us", p.percentile(0.99)},
+                                {"throughput_per_s", p.throughput()}});
+  }
+  nlohmann::json ratios;
+  for (int clients : {1, 2, 8}) {
+    ratios["lookup_p50_over_ping_p50_" + std::to_string(clients) + "_clients"] =
+        find("lookup", clients).percentile(0.5) / find("ping", clients).percentile(0.5);
+  }
+  ratios["create_p50_over_syscalls_p50"] =
+      find("create", 1).percentile(0.5) / find("create-syscalls", 1).percentile(0.5);
+  ratios["lookup_throughput_2_clients_over_1"] =
+      find("lookup", 2).throughput() / find("lookup", 1).throughput();
+  ratios["lookup_throughput_8_clients_over_1"] =
+      find("lookup", 8).throughput() / find("lookup", 1).throughput();
+  result["ratios"] = ratios;
+  result["targets"] = {{"lookup_p50_over_ping_p50", 1.3},
+                       {"create_p50_over_syscalls_p50", 1.5},
+                       {"lookup_throughput_2_clients_over_1", 1.6}};
+  std::ofstream(out + "/request_bench.json") << result.dump(2) << "\n";
+
+  std::printf("%-16s %7s %9s %10s %10s %10s %12s\n", "phase", "clients", "requests", "p50 us",
+              "p90 us", "p99 us", "per second");
+  for (const Phase& p : phases) {
+    std::printf("%-16s %7d %9zu %10.1f %10.1f %10.1f %12.0f\n", p.name.c_str(), p.clients,
+                p.micros.size(), p.percentile(0.5), p.percentile(0.9), p.percentile(0.99),
+                p.throughput());
+  }
+  std::printf("\nRatios (target in brackets):\n");
+  for (auto& [key, value] : ratios.items()) {
+    std::printf("  %-42s %6.2fx\n", key.c_str(), value.get<double>());
+  }
+  std::printf(
+      "  [lookup p50 <= 1.3x ping p50; creation <= 1.5x syscalls; 2 clients >= 1.6x one]\n");
+  return 0;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  try {
+    return run(argc, argv);
+  } catch (const std::exception& e) {
+    std::cerr << "kestrel_request_bench: " << e.what() << "\n";
+    return 1;
+  }
+}
