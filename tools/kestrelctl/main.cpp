@@ -24,10 +24,12 @@
 
 #include "client.h"
 #include "commands.h"
+#include "fsck.h"
 #include "human_output.h"
 #include "platform/linux/dbus_listener.h"
 #include "platform/plist_serialization.h"
 #include "platform/root.h"
+#include "platform/services.h"
 #include "reply_json.h"
 #include "request_items.h"
 
@@ -199,6 +201,71 @@ int runPlist(const std::string& file) {
   return kExitSuccess;
 }
 
+// The store's own messages go nowhere while fsck runs: it reports what it
+// finds itself, with the reasons.
+class SilentLogging : public platform::Logging {
+ public:
+  std::unique_ptr<platform::LogHandle> open(const std::string&, const std::string&) override {
+    return nullptr;
+  }
+  void writeWithoutHandle(int, std::string_view, std::string_view) override {}
+  void writeSystemLog(int, std::string_view) override {}
+};
+
+int runFsck(const platform::FilesystemRoot& root, const std::string& address, bool offline,
+            std::uint64_t timeoutSeconds) {
+  platform::Services services = platform::makeLinuxServices(root);
+  services.logging = std::make_shared<SilentLogging>();
+  platform::installServices(std::move(services));
+
+  kestrelctl::ListContainers list;
+  if (!offline) {
+    platform::MessageDictionary probe;
+    probe.setUint64("Command", 1);
+    const kestrelctl::CallOutcome reached =
+        kestrelctl::callDaemon(address, kServiceName, probe, timeoutSeconds);
+    if (reached.kind == kestrelctl::CallOutcome::Kind::Unreachable) {
+      std::cerr << "kestrelctl: " << reached.message << " (fsck --offline checks the disk alone)\n";
+      return kExitUnreachable;
+    }
+    list = [&](std::uint32_t user, KSTContainerClass containerClass, bool transient,
+               std::string* error) -> std::optional<std::set<std::pair<std::string, std::string>>> {
+      platform::MessageDictionary request;
+      request.setUint64("Command", 1);
+      request.setUint64("ContainerClass", containerClass);
+      request.setUint64("UserID", user);
+      request.setBoolean("Transient", transient);
+      const kestrelctl::CallOutcome outcome =
+          kestrelctl::callDaemon(address, kServiceName, request, timeoutSeconds);
+      if (outcome.kind != kestrelctl::CallOutcome::Kind::Reply) {
+        *error = outcome.message;
+        return std::nullopt;
+      }
+      if (const std::uint64_t code = outcome.reply.uint64("ReplyError"); code != 1) {
+        *error = "error " + std::to_string(code);
+        return std::nullopt;
+      }
+      std::set<std::pair<std::string, std::string>> pairs;
+      const platform::MessageArray* ids = outcome.reply.array("ReplyIdsArray");
+      const platform::MessageArray* uuids = outcome.reply.array("ReplyUUIDsArray");
+      for (std::size_t i = 0; ids && uuids && i < ids->size() && i < uuids->size(); ++i) {
+        const std::string* id = (*ids)[i].string();
+        const std::optional<platform::Uuid> uuid = (*uuids)[i].uuid();
+        if (id && uuid) pairs.emplace(*id, uuid->string());
+      }
+      return pairs;
+    };
+  }
+  const kestrelctl::FsckReport report = kestrelctl::checkContainerStore(list);
+  for (const std::string& problem : report.problems) std::cout << problem << "\n";
+  std::cout << report.containers << " containers in " << report.classDirectories
+            << " class directories" << (offline ? "" : ", compared with the daemon's cache") << ": "
+            << (report.problems.empty() ? "clean"
+                                        : std::to_string(report.problems.size()) + " problems")
+            << "\n";
+  return report.problems.empty() ? kExitSuccess : kExitReplyError;
+}
+
 int run(int argc, char** argv) {
   CLI::App app{"Send a request to kestreld and print its reply."};
   app.footer(
@@ -240,6 +307,12 @@ int run(int argc, char** argv) {
       app.add_subcommand("plist", "Print a property-list file (e.g. a metadata file) as JSON");
   plist->add_option("file", plistFile, "The file")->required();
 
+  bool offline = false;
+  CLI::App* fsck = app.add_subcommand(
+      "fsck", "Check the container store beneath the root (and the daemon's cache of it)");
+  fsck->add_flag("--offline", offline, "Check the disk alone; do not ask the daemon");
+  fsck->fallthrough();
+
   // Sized up front: the options keep pointers into their entries.
   std::vector<NamedArguments> named(kestrelctl::subcommands().size());
   for (std::size_t i = 0; i < named.size(); ++i) {
@@ -257,11 +330,12 @@ int run(int argc, char** argv) {
   }
 
   if (plist->parsed()) return runPlist(plistFile);
+  const platform::FilesystemRoot filesystemRoot =
+      root.empty() ? platform::FilesystemRoot::fromEnvironment() : platform::FilesystemRoot(root);
   if (address.empty()) {
-    const platform::FilesystemRoot filesystemRoot =
-        root.empty() ? platform::FilesystemRoot::fromEnvironment() : platform::FilesystemRoot(root);
     address = "unix:path=" + platform::messageServiceSocketPath(filesystemRoot, kServiceName);
   }
+  if (fsck->parsed()) return runFsck(filesystemRoot, address, offline, timeoutSeconds);
   for (std::size_t i = 0; i < named.size(); ++i) {
     if (named[i].app->parsed()) {
       return runNamed(address, kestrelctl::subcommands()[i], named[i], json, timeoutSeconds);
