@@ -1,0 +1,57 @@
+#!/usr/bin/env bash
+# The load test: kestreld (release build) on a fresh scratch root, N clients
+# with a mixed workload for S seconds, every answer checked; then
+# `kestrelctl fsck` checks the store on disk and against the daemon's cache.
+#
+#   scripts/load-test.sh [seconds] [clients]      # default 20 s, 4 clients
+set -euo pipefail
+cd "$(dirname "$0")/.."
+seconds="${1:-20}"
+clients="${2:-4}"
+scripts/setup.sh
+build_dir=build/bench
+cmake -S . -B "$build_dir" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+  -DKESTREL_BUILD_BENCHMARKS=ON -DKESTREL_BUILD_TESTS=OFF >/dev/null
+cmake --build "$build_dir" --target kestreld kestrelctl kestrel_load_test -j2 >/dev/null
+
+root="$(tools/make-scratch-root.sh)"
+mkdir -p "$root/etc/kestrel/signatures"
+chmod 0755 "$root/etc/kestrel" "$root/etc/kestrel/signatures"
+register() {  # name identifier binary
+  cat >"$root/etc/kestrel/signatures/$1.plist" <<PLIST
+<?xml version="1.0" encoding="UTF-8"?>
+<plist version="1.0"><dict>
+  <key>SigningIdentifier</key><string>$2</string>
+  <key>Executable</key><string>$(readlink -f "$3")</string>
+  <key>Entitlements</key><dict>
+    <key>com.zorvane.private.Kestrel.allowed</key><true/>
+  </dict>
+</dict></plist>
+PLIST
+}
+register load com.zorvane.kestrel.load "$build_dir/bench/kestrel_load_test"
+register ctl com.zorvane.kestrelctl "$build_dir/tools/kestrelctl"
+
+socket="$root/run/kestrel/com.zorvane.kestreld"
+KESTREL_ROOT="$root" "$build_dir/kestreld" 2>/dev/null &
+pid=$!
+cleanup() {
+  kill -TERM "$pid" 2>/dev/null || true
+  wait "$pid" 2>/dev/null || true
+  rm -rf "$root"
+}
+trap cleanup EXIT
+for _ in $(seq 200); do [[ -S "$socket" ]] && break; sleep 0.05; done
+
+status=0
+"$build_dir/bench/kestrel_load_test" --address "unix:path=$socket" --clients "$clients" \
+  --seconds "$seconds" || status=1
+echo "--- kestrelctl fsck"
+"$build_dir/tools/kestrelctl" --root "$root" fsck || status=1
+log="$root/private/var/root/Library/Logs/Kestrel/kestreld.log"
+if grep -q "Got exception" "$log"; then
+  echo "the daemon caught exceptions:"; grep "Got exception" "$log"; status=1
+fi
+kill -0 "$pid" 2>/dev/null || { echo "the daemon is gone"; status=1; }
+[[ $status == 0 ]] && echo "load test passed" || echo "load test FAILED"
+exit $status
