@@ -6,9 +6,12 @@
 #include <sys/acl.h>
 #include <sys/stat.h>
 
+#include <atomic>
 #include <filesystem>
+#include <map>
 #include <set>
 #include <string>
+#include <thread>
 
 #include "daemon/client_connection.h"
 #include "daemon/error_codes.h"
@@ -302,6 +305,52 @@ TEST_F(ContainerCreationTest, ListingGivesEveryContainerOfTheClass) {
   EXPECT_FALSE(client.containersForUser(501, 14, false, &code));
   EXPECT_EQ(code, kKSTErrorInvalidObject);
   EXPECT_TRUE(logged("Can't act on an invalid container-userId: 501, class: 14"));
+}
+
+}  // namespace
+}  // namespace kestrel
+
+namespace kestrel {
+namespace {
+
+// Many requests for the same few identifiers at once, as the listener's
+// concurrent queue would run them: each identifier ends with one container,
+// and nothing is left half-built.
+TEST(ContainerCreationConcurrencyTest, RacingRequestsLeaveOneContainerPerIdentifier) {
+  testing::FakeServices fakes;
+  const std::vector<std::string> identifiers = {"com.example.a", "com.example.b", "com.example.c"};
+  std::vector<std::thread> threads;
+  std::atomic<int> failures{0};
+  for (int t = 0; t < 4; ++t) {
+    threads.emplace_back([&, t] {
+      KSTClientConnection client(std::string("com.example.installer"), 0, true, std::nullopt);
+      for (int i = 0; i < 15; ++i) {
+        const std::string& identifier = identifiers[(t + i) % identifiers.size()];
+        std::uint64_t code = kKSTSuccess;
+        const bool transient = i % 5 == 4;
+        if (!client.createOrLookupContainerForUser(501, identifier, true, transient ? 11 : 2,
+                                                   transient, true, &code)) {
+          ++failures;
+        }
+        if (i % 4 == 0 && !client.containersForUser(501, 2, false, &code)) ++failures;
+      }
+    });
+  }
+  for (auto& thread : threads) thread.join();
+  EXPECT_EQ(failures.load(), 0);
+
+  std::map<std::string, int> containersOf;
+  const fs::path classDirectory =
+      KSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(501, 2, false)->path();
+  for (const auto& entry : fs::directory_iterator(classDirectory)) {
+    auto record = KSTMetadata::readAndValidateMetadataAtUrl(KSTFileURL(entry.path(), true), 501,
+                                                            true, nullptr);
+    ASSERT_TRUE(record) << entry.path();
+    ++containersOf[record->identifier()];
+  }
+  EXPECT_EQ(containersOf, (std::map<std::string, int>{
+                              {"com.example.a", 1}, {"com.example.b", 1}, {"com.example.c", 1}}));
+  EXPECT_TRUE(fs::is_empty(KSTGlobalConfiguration::sharedInstance().stagingDirectory().path()));
 }
 
 }  // namespace
