@@ -287,13 +287,9 @@ void KSTCodeSigningMappingState::_onQueue_removeCodeSigningDictionariesForIdenti
   }
   identifiers.emplace_back(identifier);
   for (const std::string& each : identifiers) {
-    // Only the entry is dropped for now; releasing the system container and
-    // group references that it held joins this step with the processing of
-    // new code-signing information.
-    std::uint64_t code = kKSTSuccess;
-    if (KSTErrorRef error = _setCodeSigningDictionaryValues({KSTCodeSigningEntry()}, {each})) {
-      KSTHandOverCode(error, &code);
-    }
+    // Processing without information releases what the entry held (system
+    // container, group references) and removes it.
+    const std::uint64_t code = _onQueue_processCodeSigningInfo(std::nullopt, each, std::nullopt);
     if (code != kKSTSuccess) {
       KSTLog(kLogError, "Failed to clear entitlements for %@ : %llu", each,
              static_cast<unsigned long long>(code));

@@ -46,6 +46,13 @@ inline constexpr const char* kKSTSystemGroupContainersEntitlement =
 inline constexpr const char* kKSTSystemContainerEntitlement =
     "com.zorvane.security.system-container";
 inline constexpr const char* kKSTSystemGroupPrefix = "systemgroup.";
+// Keys of the options that come with new code-signing information.
+inline constexpr const char* kKSTDataContainerClassOption =
+    "com.zorvane.Kestrel.DataContainerClass";
+inline constexpr const char* kKSTParentBundleIDOption = "com.zorvane.Kestrel.ParentBundleID";
+inline constexpr const char* kKSTRegisteredByCallerOption = "RegByCaller";
+inline constexpr const char* kKSTPlaceholderEntitlementsOption =
+    "com.zorvane.Kestrel.PlaceholderEntitlements";
 // Where a bundle container's info keeps the installer's cached information.
 inline constexpr const char* kKSTCachedCodeSigningInfoKey =
     "com.zorvane.Tessel.CachedCodeSigningInfo";
@@ -95,8 +102,20 @@ class KSTCodeSigningMappingState {
   KSTErrorRef _onQueue_invalidateCodeSigningInfoForIdentifierAndItsChildren(
       std::string_view identifier);
   KSTErrorRef _onQueue_invalidateCodeSigningInfoForAppsWithoutBundleContainer();
+  // Runs the processing with no information for each child of the
+  // identifier, in order, then for the identifier itself; failures are logged.
   void _onQueue_removeCodeSigningDictionariesForIdentifierAndItsChildren(
       std::string_view identifier);
+
+  // Makes new information (none: removal) the identifier's entry: links a
+  // plug-in to its parent, stages the system container for deletion when its
+  // entitlement has gone and lets the group manager drop the groups that are
+  // no longer named, all before the store changes. Returns 1, 18 without an
+  // identifier, the save's code (59, 60) or 40 for an exception. Runs with the
+  // lock on all identifiers held for writing (code_signing_processing.cpp).
+  std::uint64_t _onQueue_processCodeSigningInfo(const std::optional<PlistDictionary>& info,
+                                                const std::optional<std::string>& forIdentifier,
+                                                const std::optional<PlistDictionary>& withOptions);
 
   // Calls block for every entry, invalid and placeholder ones included, with
   // the parsed key (or the fallback key when the key gives none or an empty list).
@@ -134,6 +153,16 @@ class KSTCodeSigningMapping {
   bool invalidateCodeSigningInfoForIdentifierAndItsChildren(std::string_view identifier,
                                                             KSTErrorRef* withError);
   void removeCodeSigningDictionariesForIdentifierAndItsChildren(std::string_view identifier);
+
+  // Command 18 and admission: processes the information under the lock on all
+  // identifiers (held for writing). 1 on success; 0 when the store is unavailable.
+  std::uint64_t processCodeSigningInfo(const std::optional<PlistDictionary>& info,
+                                       const std::optional<std::string>& forIdentifier,
+                                       const std::optional<PlistDictionary>& withOptions);
+  // The client's own entitlements, registered by itself: processed as the
+  // information {Entitlements: entitlements} with the option RegByCaller.
+  std::uint64_t processCallerRegisteredEntitlements(
+      const PlistDictionary& entitlements, const std::optional<std::string>& forIdentifier);
 
   bool codeSigningInfoExistForIdentifier(std::string_view identifier);
   bool identifierHasCallerRegisteredEntitlements(std::string_view identifier);

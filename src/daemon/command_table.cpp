@@ -29,8 +29,8 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {16, KSTHandleSystemGroupContainerPaths, kKSTEntitlementNone,
        1},  // system group container paths
       {17, KSTHandleSystemGroupContainerPath, kKSTEntitlementNone,
-       1},                                       // one system group container's path
-      {18, nullptr, kKSTEntitlementAllowed,
+       1},  // one system group container's path
+      {18, KSTHandleProcessCodeSigningInfo, kKSTEntitlementAllowed,
        1},  // process code-signing information
       {19, KSTHandleGetCodeSigningInfo, kKSTEntitlementAllowed, 1},  // get code-signing information
       {20, KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kKSTEntitlementAllowed,

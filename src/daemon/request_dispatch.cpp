@@ -2,6 +2,7 @@
 
 #include <cstring>
 
+#include "codesigning/code_signing_mapping.h"
 #include "daemon/command_handlers.h"
 #include "daemon/daemon_state.h"
 #include "daemon/errors.h"
@@ -103,7 +104,21 @@ std::unique_ptr<KSTClientConnection> checkEntitlementsAndInitClientObject(
   // 8.
   auto client = std::make_unique<KSTClientConnection>(bundleId, connection.effectiveUserId(),
                                                       allowOtherIdLookup, std::move(wipeIdentifiers));
-  // 9. Caller-registered entitlements join the code-signing mapping once it exists.
+  // 9. A client that registered its own entitlements before, or that has no
+  // information at all, has them processed again; unchanged ones change
+  // nothing. Without a signing identifier there is nothing to process for.
+  if (bundleId) {
+    KSTCodeSigningMapping& mapping = KSTCodeSigningMapping::sharedInstance();
+    if (mapping.identifierHasCallerRegisteredEntitlements(*bundleId) ||
+        !mapping.codeSigningInfoExistForIdentifier(*bundleId)) {
+      const std::uint64_t code =
+          mapping.processCallerRegisteredEntitlements(entitlements, bundleId);
+      if (code != kKSTSuccess) {
+        KSTLog(kLogError, "Error processing entitlements for %@ : %llu", *bundleId,
+               static_cast<unsigned long long>(code));
+      }
+    }
+  }
   return client;
 }
 

@@ -4,8 +4,10 @@
 
 #include <chrono>
 
+#include "codesigning/code_signing_mapping.h"
 #include "daemon/daemon_state.h"
 #include "daemon/error_codes.h"
+#include "store/container_cache.h"
 #include "support/fake_services.h"
 
 namespace kestrel {
@@ -241,6 +243,26 @@ TEST_F(RequestDispatchTest, RetryTestOnACustomerBuildAnswersSuccessAndDoesNothin
   connection->deliver(message);
   EXPECT_TRUE(connection->cancelled());
   EXPECT_EQ(connection->replies().size(), 2u);
+}
+
+TEST_F(RequestDispatchTest, AClientsOwnEntitlementsAreRegisteredOnItsFirstRequest) {
+  KSTCodeSigningMapping& mapping = KSTCodeSigningMapping::sharedInstance();
+  connect(501, PlistDictionary{{kKSTSystemContainerEntitlement, true}});
+  EXPECT_FALSE(mapping.identifierHasCallerRegisteredEntitlements("com.example.client"));
+
+  // Command 15 without an identifier: the client's own system container.
+  ASSERT_TRUE(connection->deliver(request(15)));
+  EXPECT_TRUE(mapping.identifierHasCallerRegisteredEntitlements("com.example.client"));
+  auto reply = connection->lastReply();
+  ASSERT_TRUE(reply.has_value());
+  EXPECT_EQ(reply->uint64("ReplyError"), kKSTSuccess);
+  KSTErrorRef error;
+  const KSTMetadataRef container = KSTContainerCache::sharedInstance().containerForUser(
+      kKSTSystemContainerUserId, kKSTContainerClassDataSystem, "com.example.client", false, &error);
+  ASSERT_TRUE(container);
+  EXPECT_EQ(reply->string("ReplyPath"), container->url().path());
+  EXPECT_FALSE(
+      fakes.logging->containsMessage("Error processing entitlements for com.example.client"));
 }
 
 }  // namespace
