@@ -5,6 +5,7 @@
 
 #include "daemon/locks.h"
 #include "daemon/log.h"
+#include "platform/never_destroyed.h"
 #include "store/container_cache.h"
 #include "store/global_configuration.h"
 #include "store/plist_io.h"
@@ -300,8 +301,9 @@ void KSTCodeSigningMappingState::_onQueue_removeCodeSigningDictionariesForIdenti
 // ---- The public face ----------------------------------------------------------
 
 KSTCodeSigningMapping& KSTCodeSigningMapping::sharedInstance() {
-  static KSTCodeSigningMapping instance;
-  return instance;
+  static platform::NeverDestroyed<KSTCodeSigningMapping> instance(
+      [](void* where) { return new (where) KSTCodeSigningMapping(); });
+  return *instance;
 }
 
 KSTCodeSigningMapping::KSTCodeSigningMapping()

@@ -1,5 +1,7 @@
 #include "daemon/client_connection.h"
 
+#include "platform/never_destroyed.h"
+
 namespace kestrel {
 
 KSTClientConnection::KSTClientConnection(
@@ -15,8 +17,10 @@ KSTClientConnection::KSTClientConnection(std::optional<std::string> bundleId,
     : KSTClientConnection(std::move(bundleId), 0, allowOtherIdLookup, std::nullopt) {}
 
 KSTClientConnection& KSTClientConnection::sharedClientConnection() {
-  static KSTClientConnection shared(std::string(kInternalBundleIdentifier), true);
-  return shared;
+  static platform::NeverDestroyed<KSTClientConnection> shared([](void* where) {
+    return new (where) KSTClientConnection(std::string(kInternalBundleIdentifier), true);
+  });
+  return *shared;
 }
 
 }  // namespace kestrel

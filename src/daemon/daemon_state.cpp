@@ -5,6 +5,7 @@
 #include <vector>
 
 #include "daemon/log.h"
+#include "platform/never_destroyed.h"
 #include "platform/services.h"
 
 namespace kestrel {
@@ -19,8 +20,8 @@ struct Queues {
 };
 
 Queues& queues() {
-  static Queues q;
-  return q;
+  static platform::NeverDestroyed<Queues> q([](void* where) { return new (where) Queues(); });
+  return *q;
 }
 
 // Touched only by the lock-state callback, on the main queue.
@@ -94,7 +95,9 @@ void KSTLockStateChanged() {
   gIsLocked = state == platform::KeyBag::kLocked;
 }
 
-bool KSTIsLocked() { return gIsLocked; }
+bool KSTIsLocked() {
+  return gIsLocked;
+}
 
 void KSTDispatchAsyncWithTransaction(const std::shared_ptr<platform::DispatchQueue>& queue,
                                      std::function<void()> block) {

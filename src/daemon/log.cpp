@@ -3,6 +3,7 @@
 #include <atomic>
 #include <mutex>
 
+#include "platform/never_destroyed.h"
 #include "platform/services.h"
 
 namespace kestrel {
@@ -17,8 +18,8 @@ struct LogState {
 };
 
 LogState& state() {
-  static LogState s;
-  return s;
+  static platform::NeverDestroyed<LogState> s([](void* where) { return new (where) LogState(); });
+  return *s;
 }
 
 std::shared_ptr<platform::LogHandle> currentHandle() {
@@ -44,11 +45,19 @@ bool Log::enableDiskLogging(const std::string& path, std::size_t fileCount, std:
   return handle && handle->enableDiskLogging(path, fileCount, fileSize, options);
 }
 
-bool Log::hasHandle() { return state().hasHandle; }
-int Log::currentLevel() { return state().level; }
-void Log::setCurrentLevel(int level) { state().level = level; }
+bool Log::hasHandle() {
+  return state().hasHandle;
+}
+int Log::currentLevel() {
+  return state().level;
+}
+void Log::setCurrentLevel(int level) {
+  state().level = level;
+}
 
-bool Log::isEnabled(int level) { return !state().hasHandle || state().level >= level; }
+bool Log::isEnabled(int level) {
+  return !state().hasHandle || state().level >= level;
+}
 
 void Log::write(int level, std::string_view tag, std::string_view message) {
   if (!isEnabled(level)) return;

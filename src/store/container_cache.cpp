@@ -4,6 +4,7 @@
 
 #include "daemon/exceptions.h"
 #include "daemon/log.h"
+#include "platform/never_destroyed.h"
 #include "store/file_manager.h"
 #include "store/global_configuration.h"
 
@@ -63,8 +64,9 @@ auto runCatchingExceptions(const char* function, int line, KSTErrorRef* error, F
 }  // namespace
 
 KSTContainerCache& KSTContainerCache::sharedInstance() {
-  static KSTContainerCache instance;
-  return instance;
+  static platform::NeverDestroyed<KSTContainerCache> instance(
+      [](void* where) { return new (where) KSTContainerCache(); });
+  return *instance;
 }
 
 KSTContainerCache::ClassMap* KSTContainerCache::_getCacheForUserId(std::uint32_t userId,

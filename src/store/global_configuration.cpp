@@ -1,6 +1,7 @@
 #include "store/global_configuration.h"
 
 #include "daemon/log.h"
+#include "platform/never_destroyed.h"
 #include "platform/services.h"
 #include "store/file_manager.h"
 #include "store/layout_directory.h"
@@ -22,8 +23,9 @@ KSTFileURL systemDirectory(std::string_view systemPath) {
 }  // namespace
 
 KSTGlobalConfiguration& KSTGlobalConfiguration::sharedInstance() {
-  static KSTGlobalConfiguration instance;
-  return instance;
+  static platform::NeverDestroyed<KSTGlobalConfiguration> instance(
+      [](void* where) { return new (where) KSTGlobalConfiguration(); });
+  return *instance;
 }
 
 KSTGlobalConfiguration::KSTGlobalConfiguration()

@@ -14,6 +14,7 @@
 #include <thread>
 
 #include "daemon/client_connection.h"
+#include "daemon/daemon_state.h"
 #include "daemon/error_codes.h"
 #include "platform/linux/extended_acl_linux.h"
 #include "store/container_cache.h"
@@ -47,6 +48,17 @@ std::set<std::string> entriesOf(const fs::path& directory) {
   }
   return names;
 }
+
+// Transient renewals and failed creations start death-row sweeps; they run
+// on the death-row queue, and each test waits for them before its scratch
+// root goes.
+class DeathRowQueue {
+ public:
+  DeathRowQueue() { EXPECT_TRUE(KSTCreateWorkQueues()); }
+  ~DeathRowQueue() {
+    KSTDeathRowQueue()->sync([] {});
+  }
+};
 
 class ContainerCreationTest : public ::testing::Test {
  protected:
@@ -90,6 +102,7 @@ class ContainerCreationTest : public ::testing::Test {
   }
 
   testing::FakeServices fakes;
+  DeathRowQueue deathRowQueue;
   KSTClientConnection client{std::string("com.example.installer"), 0, true, std::nullopt};
 };
 
@@ -318,6 +331,7 @@ namespace {
 // and nothing is left half-built.
 TEST(ContainerCreationConcurrencyTest, RacingRequestsLeaveOneContainerPerIdentifier) {
   testing::FakeServices fakes;
+  DeathRowQueue deathRowQueue;
   const std::vector<std::string> identifiers = {"com.example.a", "com.example.b", "com.example.c"};
   std::vector<std::thread> threads;
   std::atomic<int> failures{0};
