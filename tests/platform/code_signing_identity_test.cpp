@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <iterator>
 #include <optional>
 #include <string>
 #include <thread>
@@ -400,6 +401,27 @@ TEST(CodeSigningIdentityTest, ConcurrentLookupsWhileTheRegistryChanges) {
   for (std::thread& reader : readers) reader.join();
   EXPECT_EQ(unexpected, 0);
   EXPECT_EQ(identity.identify(alpha).signingIdentifier, "com.example.alpha");
+}
+
+}  // namespace
+}  // namespace kestrel::platform
+
+namespace kestrel::platform {
+namespace {
+
+// A damaged file (here a binary list whose string holds a NUL byte, which
+// libplist itself asserts on) is refused like any unreadable one; the other
+// entries still identify their peers.
+TEST(CodeSigningIdentityTest, DamagedRegistryFileIsRefusedNotFollowed) {
+  Registry registry;
+  std::ifstream in(
+      std::string(KESTREL_SOURCE_DIR) + "/fuzz/corpus/fuzz_signing_registry/string_with_nul.bplist",
+      std::ios::binary);
+  ASSERT_TRUE(in);
+  registry.writeEntry("damaged.plist", std::string(std::istreambuf_iterator<char>(in), {}));
+  const CodeSigningIdentityResult alpha = LinuxCodeSigningIdentity(registry.scratch.root())
+                                              .identify(registry.peer(registry.client("alpha")));
+  EXPECT_EQ(alpha.signingIdentifier, "com.example.alpha");
 }
 
 }  // namespace

@@ -2,7 +2,6 @@
 
 #include <dirent.h>
 #include <fcntl.h>
-#include <plist/plist.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -19,6 +18,7 @@
 #include <utility>
 #include <vector>
 
+#include "platform/plist_serialization.h"
 #include "platform/unique_fd.h"
 
 namespace kestrel::platform {
@@ -33,7 +33,6 @@ constexpr const char* kLabelKey = "Label";
 constexpr const char* kExecutableKey = "Executable";
 // A registry file is a few hundred bytes; anything this large is not one.
 constexpr off_t kMaximumRegistryFileSize = 1 << 20;
-// Entitlements are shallow; a deeper file is refused rather than followed.
 constexpr int kMaximumNestingDepth = 64;
 
 std::string errorText(int error) {
@@ -41,116 +40,31 @@ std::string errorText(int error) {
 }
 
 // ---------------------------------------------------------------------------
-// Reading property lists with libplist. A small conversion local to the
-// registry: it knows only what a registry file may contain.
+// Reading registry files: the daemon's guarded parser, which refuses what
+// libplist would choke on (NUL bytes in strings, cycles, absurd nesting or
+// object counts) before it gets there.
 
-struct PlistNodeDeleter {
-  void operator()(plist_t node) const { plist_free(node); }
-};
-using UniquePlistNode = std::unique_ptr<void, PlistNodeDeleter>;
-
-struct FreeDeleter {
-  void operator()(void* p) const { std::free(p); }
-};
-using MallocedChars = std::unique_ptr<char, FreeDeleter>;
-
-struct DictIteratorDeleter {
-  void operator()(void* iterator) const { std::free(iterator); }
-};
-using UniqueDictIterator = std::unique_ptr<void, DictIteratorDeleter>;
-
-std::optional<PlistValue> convertNode(plist_t node, int depth);
-
-std::optional<PlistValue> convertDictionary(plist_t node, int depth) {
-  PlistDictionary dictionary;
-  plist_dict_iter rawIterator = nullptr;
-  plist_dict_new_iter(node, &rawIterator);
-  const UniqueDictIterator iterator(rawIterator);
-  if (!iterator) return PlistDictionary{};
-  for (;;) {
-    char* rawKey = nullptr;
-    plist_t child = nullptr;
-    plist_dict_next_item(node, iterator.get(), &rawKey, &child);
-    const MallocedChars key(rawKey);
-    if (!key) break;
-    if (child == nullptr) return std::nullopt;
-    std::optional<PlistValue> value = convertNode(child, depth + 1);
-    if (!value) return std::nullopt;
-    dictionary.insert_or_assign(std::string(key.get()), std::move(*value));
+// Entitlements are shallow; a deeper file is refused rather than followed.
+bool fitsNestingDepth(const PlistValue& value, int depth) {
+  if (depth > kMaximumNestingDepth) return false;
+  if (const PlistArray* array = value.array()) {
+    for (const PlistValue& item : *array) {
+      if (!fitsNestingDepth(item, depth + 1)) return false;
+    }
+  } else if (const PlistDictionary* dictionary = value.dictionary()) {
+    for (const auto& [key, item] : *dictionary) {
+      if (!fitsNestingDepth(item, depth + 1)) return false;
+    }
   }
-  return PlistValue(std::move(dictionary));
+  return true;
 }
 
-std::optional<PlistValue> convertNode(plist_t node, int depth) {
-  if (depth > kMaximumNestingDepth) return std::nullopt;
-  switch (plist_get_node_type(node)) {
-    case PLIST_DICT:
-      return convertDictionary(node, depth);
-    case PLIST_ARRAY: {
-      PlistArray array;
-      const std::uint32_t count = plist_array_get_size(node);
-      array.reserve(count);
-      for (std::uint32_t i = 0; i < count; ++i) {
-        std::optional<PlistValue> value = convertNode(plist_array_get_item(node, i), depth + 1);
-        if (!value) return std::nullopt;
-        array.push_back(std::move(*value));
-      }
-      return PlistValue(std::move(array));
-    }
-    case PLIST_STRING: {
-      char* raw = nullptr;
-      plist_get_string_val(node, &raw);
-      const MallocedChars text(raw);
-      return PlistValue(std::string(text ? text.get() : ""));
-    }
-    case PLIST_BOOLEAN: {
-      std::uint8_t value = 0;
-      plist_get_bool_val(node, &value);
-      return PlistValue(value != 0);
-    }
-    case PLIST_UINT: {
-      // This libplist keeps every integer as 64 bits without a sign; the
-      // negative numbers a file may hold come back in two's complement, and
-      // entitlement numbers are small, so the bits are read as signed.
-      std::uint64_t value = 0;
-      plist_get_uint_val(node, &value);
-      return PlistValue(static_cast<std::int64_t>(value));
-    }
-    case PLIST_REAL: {
-      double value = 0;
-      plist_get_real_val(node, &value);
-      return PlistValue(value);
-    }
-    case PLIST_DATA: {
-      char* raw = nullptr;
-      std::uint64_t length = 0;
-      plist_get_data_val(node, &raw, &length);
-      const MallocedChars bytes(raw);
-      const auto* begin = reinterpret_cast<const std::uint8_t*>(bytes.get());
-      return PlistValue(bytes ? PlistData(begin, begin + length) : PlistData{});
-    }
-    case PLIST_DATE: {
-      std::int32_t seconds = 0;
-      std::int32_t microseconds = 0;
-      plist_get_date_val(node, &seconds, &microseconds);
-      return PlistValue(PlistDate{seconds + microseconds / 1e6});
-    }
-    default:
-      return std::nullopt;  // keys, UIDs and anything newer have no place here
-  }
-}
-
-// Parses a property list in any format libplist reads. Nothing for bytes that
-// are not one.
-std::optional<PlistValue> parsePropertyList(const std::string& bytes) {
-  if (bytes.empty() || bytes.size() > std::numeric_limits<std::uint32_t>::max()) {
-    return std::nullopt;
-  }
-  plist_t raw = nullptr;
-  plist_from_memory(bytes.data(), static_cast<std::uint32_t>(bytes.size()), &raw);
-  const UniquePlistNode root(raw);
-  if (!root) return std::nullopt;
-  return convertNode(root.get(), 0);
+std::optional<PlistValue> parseRegistryFile(const std::string& bytes) {
+  if (bytes.empty()) return std::nullopt;
+  const auto* begin = reinterpret_cast<const std::uint8_t*>(bytes.data());
+  std::optional<PlistValue> value = parsePropertyList(std::span(begin, bytes.size()), nullptr);
+  if (value && !fitsNestingDepth(*value, 0)) return std::nullopt;
+  return value;
 }
 
 // ---------------------------------------------------------------------------
@@ -297,7 +211,7 @@ struct LinuxCodeSigningIdentity::Registry {
       problems.push_back(name + " " + problem);
       return;
     }
-    addEntry(name, parsePropertyList(contents));
+    addEntry(name, parseRegistryFile(contents));
   }
 
   void addEntry(const std::string& name, const std::optional<PlistValue>& plist) {
