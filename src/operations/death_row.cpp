@@ -20,6 +20,8 @@ namespace kestrel {
 namespace {
 
 constexpr const char* kTempDirectory = "/tmp";
+// Holders a move tries before it gives up on sweeps taking them away.
+constexpr int kHolderAttempts = 8;
 
 // The work of the members, free of any client: the sweep outlives the request
 // that asked for it.
@@ -81,26 +83,34 @@ bool KSTClientConnection::_moveItemAtURLToDeathRow(const KSTFileURL& url, bool i
   const KSTFileURL deathRow = KSTGlobalConfiguration::sharedInstance().deathrowDirectory();
 
   // A holder of its own, so that two items of the same name never collide.
-  KSTErrorRef createError;
-  const std::optional<KSTFileURL> holder =
-      fileManager.createTemporaryDirectoryInDirectoryURL(deathRow, &createError);
-  if (!holder) {
-    KSTSetError(error, KST_ERROR(kKSTErrorDeathRowMoveFailed, createError, true,
-                                 "Failed to create unique directory at: %@", url));
+  // A sweep running meanwhile may take a fresh, still empty holder with it
+  // before the item arrives; the rename then finds no destination, and the
+  // item, still in place, gets a new holder.
+  for (int attempt = 1;; ++attempt) {
+    KSTErrorRef createError;
+    const std::optional<KSTFileURL> holder =
+        fileManager.createTemporaryDirectoryInDirectoryURL(deathRow, &createError);
+    if (!holder) {
+      KSTSetError(error, KST_ERROR(kKSTErrorDeathRowMoveFailed, createError, true,
+                                   "Failed to create unique directory at: %@", url));
+      return false;
+    }
+
+    const KSTFileURL destination = holder->appending(url.lastPathComponent(), isDir);
+    KSTErrorRef moveError;
+    if (fileManager.moveItemAtURL(url, destination, &moveError)) {
+      if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
+      return true;
+    }
+    if (moveError && moveError->isPOSIXError(ENOENT)) {
+      // Nothing to move. The empty holder goes with the next sweep.
+      if (fileManager.itemDoesNotExistAtURL(url)) return true;
+      if (attempt < kHolderAttempts) continue;
+    }
+    KSTSetError(error, KST_ERROR(kKSTErrorDeathRowMoveFailed, moveError, true,
+                                 "Failed to move item at: %@ to: %@", url, destination));
     return false;
   }
-
-  const KSTFileURL destination = holder->appending(url.lastPathComponent(), isDir);
-  KSTErrorRef moveError;
-  if (fileManager.moveItemAtURL(url, destination, &moveError)) {
-    if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
-    return true;
-  }
-  // Nothing to move. The empty holder goes with the next sweep.
-  if (moveError && moveError->isPOSIXError(ENOENT)) return true;
-  KSTSetError(error, KST_ERROR(kKSTErrorDeathRowMoveFailed, moveError, true,
-                               "Failed to move item at: %@ to: %@", url, destination));
-  return false;
 }
 
 void KSTClientConnection::deleteContainersOnDeathRowWithCompletion(
