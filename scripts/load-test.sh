@@ -9,10 +9,9 @@ cd "$(dirname "$0")/.."
 seconds="${1:-20}"
 clients="${2:-4}"
 scripts/setup.sh
-build_dir=build/bench
-cmake -S . -B "$build_dir" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DKESTREL_BUILD_BENCHMARKS=ON -DKESTREL_BUILD_TESTS=OFF >/dev/null
-cmake --build "$build_dir" --target kestreld kestrelctl kestrel_load_test -j2 >/dev/null
+build_dir=build/release
+cmake --preset release >/dev/null
+cmake --build --preset release --target kestreld kestrelctl kestrel_load_test >/dev/null
 
 root="$(tools/make-scratch-root.sh)"
 mkdir -p "$root/etc/kestrel/signatures"
@@ -29,22 +28,23 @@ register() {  # name identifier binary
 </dict></plist>
 PLIST
 }
-register load com.zorvane.kestrel.load "$build_dir/bench/kestrel_load_test"
+register load com.zorvane.kestrel.load "$build_dir/tools/kestrel_load_test"
 register ctl com.zorvane.kestrelctl "$build_dir/tools/kestrelctl"
 
 socket="$root/run/kestrel/com.zorvane.kestreld"
 KESTREL_ROOT="$root" "$build_dir/kestreld" 2>/dev/null &
 pid=$!
+status=0
 cleanup() {
   kill -TERM "$pid" 2>/dev/null || true
   wait "$pid" 2>/dev/null || true
-  rm -rf "$root"
+  # A failed run keeps its root for a look at the store and the log.
+  if [[ $status == 0 ]]; then rm -rf "$root"; else echo "root kept: $root"; fi
 }
 trap cleanup EXIT
 for _ in $(seq 200); do [[ -S "$socket" ]] && break; sleep 0.05; done
 
-status=0
-"$build_dir/bench/kestrel_load_test" --address "unix:path=$socket" --clients "$clients" \
+"$build_dir/tools/kestrel_load_test" --address "unix:path=$socket" --clients "$clients" \
   --seconds "$seconds" || status=1
 echo "--- kestrelctl fsck"
 "$build_dir/tools/kestrelctl" --root "$root" fsck || status=1
