@@ -25,14 +25,6 @@ namespace kestrel {
 
 namespace {
 
-// Identifiers come from clients and may be of any length; the log gets a
-// bounded prefix of the long ones.
-std::optional<std::string> identifierForLog(const std::optional<std::string>& identifier) {
-  constexpr std::size_t kShown = 64;
-  if (!identifier || identifier->size() <= kKSTMaxIdentifierLength) return identifier;
-  return identifier->substr(0, kShown) + "... (" + std::to_string(identifier->size()) + " bytes)";
-}
-
 // The batch itself, under whatever lock the caller took. Entries that are
 // malformed, or name no cached container, are skipped; a container that can
 // be neither moved nor removed is skipped too and stays mapped and cached.
@@ -67,7 +59,7 @@ bool stageForDeleteContainersWithUsers(KSTClientConnection& client,
     if (!uuid || !identifier || !KSTIsValidContainerClass(containerClass)) {
       KST_ERROR(kKSTErrorInvalidObject, nullptr, true,
                 "Can't act on an invalid object: userId: %u, UUID: %@, ID: %@, Class: %ld", userId,
-                uuid, identifierForLog(identifier), containerClass);
+                uuid, KSTIdentifierForLog(identifier), containerClass);
       continue;
     }
 
@@ -172,7 +164,7 @@ void KSTClientConnection::deleteContainerForUser(std::uint32_t userId,
     KSTLog(kLogError,
            "Failed to lookup existing container to delete-identifier: %@, class: %ld, "
            "transient: %d",
-           identifierForLog(withIdentifier), containerClass, transient ? 1 : 0);
+           KSTIdentifierForLog(withIdentifier), containerClass, transient ? 1 : 0);
     if (code == kKSTSuccess) code = kKSTErrorNotFound;
   } else {
     KST_CATCH_EXCEPTIONS(&code, [&] {

@@ -53,14 +53,6 @@ const std::vector<std::string_view>& subDirectoryNames(KSTContainerClass contain
   }
 }
 
-// Identifiers of any length reach the log only through this: a client must
-// not be able to write megabytes into it.
-std::optional<std::string> identifierForLog(const std::optional<std::string>& identifier) {
-  constexpr std::size_t kShown = 64;
-  if (!identifier || identifier->size() <= kKSTMaxIdentifierLength) return identifier;
-  return identifier->substr(0, kShown) + "... (" + std::to_string(identifier->size()) + " bytes)";
-}
-
 }  // namespace
 
 bool KSTClientConnection::_createDefaultDirectory(const KSTFileURL& url, mode_t mode, uid_t owner,
@@ -229,7 +221,7 @@ KSTMetadataRef KSTClientConnection::createOrLookupContainerForUser(
       !KSTIsValidContainerClass(containerClass)) {
     KSTHandOverCode(KST_ERROR(kKSTErrorInvalidObject, nullptr, true,
                               "Can't act on an invalid object: userId: %u, ID: %@, class: %ld",
-                              userId, identifierForLog(identifier), containerClass),
+                              userId, KSTIdentifierForLog(identifier), containerClass),
                     withError);
     return nullptr;
   }

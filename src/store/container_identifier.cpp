@@ -7,4 +7,10 @@ bool KSTIdentifierIsUsable(std::string_view identifier) {
   return identifier.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
 }
 
+std::optional<std::string> KSTIdentifierForLog(const std::optional<std::string>& identifier) {
+  constexpr std::size_t kShown = 64;
+  if (!identifier || identifier->size() <= kKSTMaxIdentifierLength) return identifier;
+  return identifier->substr(0, kShown) + "... (" + std::to_string(identifier->size()) + " bytes)";
+}
+
 }  // namespace kestrel

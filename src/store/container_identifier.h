@@ -4,6 +4,8 @@
 #pragma once
 
 #include <cstddef>
+#include <optional>
+#include <string>
 #include <string_view>
 
 namespace kestrel {
@@ -13,5 +15,9 @@ inline constexpr std::size_t kKSTMaxIdentifierLength = 1024;
 
 // Not empty, at most kKSTMaxIdentifierLength bytes, no "/" and no NUL.
 bool KSTIdentifierIsUsable(std::string_view identifier);
+
+// The identifier as log lines show it: identifiers come from clients and may
+// be of any length, so a long one is cut to a bounded prefix and its size.
+std::optional<std::string> KSTIdentifierForLog(const std::optional<std::string>& identifier);
 
 }  // namespace kestrel
