@@ -24,7 +24,9 @@ class NeverDestroyed {
  public:
   // make(where) constructs the object at where (placement new) and returns it.
   template <typename Make>
-  explicit NeverDestroyed(Make&& make) : object_(std::forward<Make>(make)(storage_)) {}
+  explicit NeverDestroyed(Make&& make) {
+    object_ = std::forward<Make>(make)(static_cast<void*>(storage_));
+  }
 
   NeverDestroyed(const NeverDestroyed&) = delete;
   NeverDestroyed& operator=(const NeverDestroyed&) = delete;
@@ -34,7 +36,7 @@ class NeverDestroyed {
 
  private:
   alignas(T) unsigned char storage_[sizeof(T)];
-  T* object_;
+  T* object_ = nullptr;
 };
 
 }  // namespace kestrel::platform
