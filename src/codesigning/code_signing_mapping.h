@@ -116,6 +116,11 @@ class KSTCodeSigningMappingState {
   std::uint64_t _onQueue_processCodeSigningInfo(const std::optional<PlistDictionary>& info,
                                                 const std::optional<std::string>& forIdentifier,
                                                 const std::optional<PlistDictionary>& withOptions);
+  // True when the identifier's entry is already what processing its own
+  // entitlements (registered by itself) would make of it, so that processing
+  // them again would change nothing.
+  bool _onQueue_callerRegisteredInfoIsCurrent(const std::string& identifier,
+                                              const PlistDictionary& info) const;
 
   // Calls block for every entry, invalid and placeholder ones included, with
   // the parsed key (or the fallback key when the key gives none or an empty list).
@@ -161,6 +166,8 @@ class KSTCodeSigningMapping {
                                        const std::optional<PlistDictionary>& withOptions);
   // The client's own entitlements, registered by itself: processed as the
   // information {Entitlements: entitlements} with the option RegByCaller.
+  // Entitlements that are already the entry's change nothing and are not
+  // processed again, so the lock on all identifiers is not taken for them.
   std::uint64_t processCallerRegisteredEntitlements(
       const PlistDictionary& entitlements, const std::optional<std::string>& forIdentifier);
 

@@ -197,9 +197,37 @@ std::uint64_t KSTCodeSigningMapping::processCodeSigningInfo(
   });
 }
 
+bool KSTCodeSigningMappingState::_onQueue_callerRegisteredInfoIsCurrent(
+    const std::string& identifier, const PlistDictionary& info) const {
+  // What steps 3 to 8 of the processing would compare, for the options
+  // {RegByCaller: YES} alone: no parent, no data container class.
+  const KSTCodeSigningEntry* old = entryForIdentifier(identifier);
+  if (old == nullptr) return false;
+  KSTCodeSigningEntry entry;
+  if (old->childBundleIdentifiers()) {
+    std::vector<std::string> children = *old->childBundleIdentifiers();
+    std::erase_if(children,
+                  [&](const std::string& child) { return entryForIdentifier(child) == nullptr; });
+    entry.setChildBundleIdentifiers(std::move(children));
+  }
+  entry.setRegisteredByCaller(true);
+  entry.setCodeSigningInfo(info);
+  return entry.isEqual(*old);
+}
+
 std::uint64_t KSTCodeSigningMapping::processCallerRegisteredEntitlements(
     const PlistDictionary& entitlements, const std::optional<std::string>& forIdentifier) {
-  return processCodeSigningInfo(PlistDictionary{{kKSTEntitlementsKey, entitlements}}, forIdentifier,
+  const PlistDictionary info{{kKSTEntitlementsKey, entitlements}};
+  // A client that registers its own entitlements has them processed with
+  // every request; almost always they are what they were. Processing would
+  // then change nothing, and every other request would still have waited for
+  // it to take the lock on all identifiers.
+  if (forIdentifier && withState(false, [&](KSTCodeSigningMappingState& state) {
+        return state._onQueue_callerRegisteredInfoIsCurrent(*forIdentifier, info);
+      })) {
+    return kKSTSuccess;
+  }
+  return processCodeSigningInfo(info, forIdentifier,
                                 PlistDictionary{{kKSTRegisteredByCallerOption, true}});
 }
 

@@ -3,15 +3,19 @@
 // parents, and that unchanged information writes nothing.
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <functional>
+#include <future>
+#include <thread>
 #include <utility>
 
 #include "codesigning/code_signing_mapping.h"
 #include "daemon/client_connection.h"
 #include "daemon/command_handlers.h"
 #include "daemon/error_codes.h"
+#include "daemon/locks.h"
 #include "platform/sandbox.h"
 #include "store/container_cache.h"
 #include "support/fake_services.h"
@@ -287,6 +291,45 @@ TEST_F(CodeSigningProcessingTest, CommandEighteenTakesDictionariesOnly) {
   // Information that is not a dictionary removes the entry.
   EXPECT_EQ(run(PlistValue(PlistArray{"x"}), std::nullopt), kKSTSuccess);
   EXPECT_FALSE(entry("com.example.app"));
+}
+
+}  // namespace
+}  // namespace kestrel
+
+namespace kestrel {
+namespace {
+
+// Unchanged caller-registered entitlements are answered without the lock on
+// all identifiers: a request of such a client does not wait behind a
+// creation holding it. Changed ones do wait for it.
+TEST(CodeSigningProcessingConcurrencyTest, UnchangedCallerEntitlementsDoNotTakeTheLock) {
+  testing::FakeServices fakes;
+  KSTCodeSigningMapping& mapping = KSTCodeSigningMapping::sharedInstance();
+  const PlistDictionary entitlements{{"com.zorvane.private.Kestrel.none", true}};
+  ASSERT_EQ(mapping.processCallerRegisteredEntitlements(entitlements, "com.example.app"),
+            kKSTSuccess);
+
+  std::promise<void> held, release;
+  std::thread holder([&] {
+    KSTAllIdentifiersLockGuard all(kKSTLockForWriting);
+    held.set_value();
+    release.get_future().wait();
+  });
+  held.get_future().wait();
+  auto unchanged = std::async(std::launch::async, [&] {
+    return mapping.processCallerRegisteredEntitlements(entitlements, "com.example.app");
+  });
+  EXPECT_EQ(unchanged.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+  auto changed = std::async(std::launch::async, [&] {
+    return mapping.processCallerRegisteredEntitlements(
+        PlistDictionary{{"com.zorvane.private.Kestrel.allowed", true}}, "com.example.app");
+  });
+  EXPECT_EQ(changed.wait_for(std::chrono::milliseconds(200)), std::future_status::timeout);
+  release.set_value();
+  holder.join();
+  EXPECT_EQ(unchanged.get(), kKSTSuccess);
+  EXPECT_EQ(changed.get(), kKSTSuccess);
+  EXPECT_TRUE(mapping.identifierHasCallerRegisteredEntitlements("com.example.app"));
 }
 
 }  // namespace
