@@ -150,10 +150,36 @@ void checkNoCycle(const QueueImpl& queue, const std::shared_ptr<QueueImpl>& targ
 // it). A drain that finds the queue anything but Scheduled is a leftover and
 // returns at once, which lets a sync() caller take a Scheduled queue over.
 
-class SerialQueue : public QueueImpl {
+// What serial and concurrent queues share: a target that may be changed
+// until the first item is submitted, guarded by the queue's mutex.
+class TargetedQueue : public QueueImpl {
+ public:
+  TargetedQueue(std::string label, std::shared_ptr<QueueImpl> target)
+      : QueueImpl(std::move(label)), target_(std::move(target)) {}
+
+  void setTarget(std::shared_ptr<DispatchQueue> target) override {
+    auto impl = asTarget(label(), std::move(target));
+    checkNoCycle(*this, impl);
+    std::lock_guard lock(mutex_);
+    if (used_) fail("setTarget() on queue '%s' after items were submitted", label().c_str());
+    target_ = std::move(impl);
+  }
+
+  std::shared_ptr<QueueImpl> parent() const override {
+    std::lock_guard lock(mutex_);
+    return target_;
+  }
+
+ protected:
+  mutable std::mutex mutex_;
+  bool used_ = false;  // an item was submitted: the target is fixed
+  std::shared_ptr<QueueImpl> target_;
+};
+
+class SerialQueue : public TargetedQueue {
  public:
   SerialQueue(std::string label, std::shared_ptr<QueueImpl> target)
-      : QueueImpl(std::move(label)), target_(std::move(target)) {}
+      : TargetedQueue(std::move(label), std::move(target)) {}
 
   void async(Work work) override {
     std::unique_lock lock(mutex_);
@@ -178,19 +204,6 @@ class SerialQueue : public QueueImpl {
     if (!startLocked()) return;
     lock.unlock();
     scheduleDrain();
-  }
-
-  void setTarget(std::shared_ptr<DispatchQueue> target) override {
-    auto impl = asTarget(label(), std::move(target));
-    checkNoCycle(*this, impl);
-    std::lock_guard lock(mutex_);
-    if (used_) fail("setTarget() on queue '%s' after items were submitted", label().c_str());
-    target_ = std::move(impl);
-  }
-
-  std::shared_ptr<QueueImpl> parent() const override {
-    std::lock_guard lock(mutex_);
-    return target_;
   }
 
   bool exclusive() const override { return true; }
@@ -351,14 +364,11 @@ class SerialQueue : public QueueImpl {
     }
   }
 
-  mutable std::mutex mutex_;
   std::condition_variable changed_;
   std::deque<Item> items_;
   State state_ = State::Idle;
   unsigned suspended_ = 0;
   unsigned waiters_ = 0;
-  bool used_ = false;
-  std::shared_ptr<QueueImpl> target_;
 };
 
 // ---------------------------------------------------------------------------
@@ -366,10 +376,10 @@ class SerialQueue : public QueueImpl {
 // "run one item" request per item, so that a suspended queue holds back even
 // the items whose requests are already waiting on the target.
 
-class ConcurrentQueue : public QueueImpl {
+class ConcurrentQueue : public TargetedQueue {
  public:
   ConcurrentQueue(std::string label, std::shared_ptr<QueueImpl> target)
-      : QueueImpl(std::move(label)), target_(std::move(target)) {}
+      : TargetedQueue(std::move(label), std::move(target)) {}
 
   void async(Work work) override {
     std::unique_lock lock(mutex_);
@@ -400,19 +410,6 @@ class ConcurrentQueue : public QueueImpl {
     for (std::size_t i = 0; i < missing; ++i) request(*target);
   }
 
-  void setTarget(std::shared_ptr<DispatchQueue> target) override {
-    auto impl = asTarget(label(), std::move(target));
-    checkNoCycle(*this, impl);
-    std::lock_guard lock(mutex_);
-    if (used_) fail("setTarget() on queue '%s' after items were submitted", label().c_str());
-    target_ = std::move(impl);
-  }
-
-  std::shared_ptr<QueueImpl> parent() const override {
-    std::lock_guard lock(mutex_);
-    return target_;
-  }
-
   bool exclusive() const override { return false; }
 
   void acquireForSync(bool) override {
@@ -441,13 +438,10 @@ class ConcurrentQueue : public QueueImpl {
     runItem(label(), work);
   }
 
-  mutable std::mutex mutex_;
   std::condition_variable resumed_;
   std::deque<Work> items_;
   std::size_t requests_ = 0;
   unsigned suspended_ = 0;
-  bool used_ = false;
-  std::shared_ptr<QueueImpl> target_;
 };
 
 // ---------------------------------------------------------------------------
