@@ -360,14 +360,7 @@ TEST_F(CodeSigningMappingTest, InvalidationAndRemovalReachTheChildren) {
 
 TEST_F(CodeSigningMappingTest, CommandsNineteenAndTwentyAnswerThroughTheDispatcher) {
   ASSERT_TRUE(KSTStartRequestListener(platform::DispatchQueue::createConcurrent("test.listener")));
-  platform::CodeSigningIdentityResult identity;
-  identity.signingIdentifier = "com.example.installer";
-  identity.entitlements = PlistDictionary{{kKSTEntitlementAllowed, true}};
-  fakes.codeSigningIdentity->setIdentityForPid(4242, identity);
-  platform::PeerCredentials peer;
-  peer.pid = 4242;
-  peer.uid = 0;
-  auto connection = fakes.messageIPC->connect(peer);
+  auto connection = fakes.connectAllowedClient();
 
   KSTCodeSigningMapping& shared = KSTCodeSigningMapping::sharedInstance();
   const PlistDictionary info =

@@ -283,13 +283,7 @@ TEST_F(ContainerDeletionTest, CommandsThreeAndTenAnswerThroughTheDispatcher) {
   const KSTMetadataRef second = create(501, 7, "group.com.example");
   ASSERT_TRUE(first && second);
 
-  platform::CodeSigningIdentityResult identity;
-  identity.signingIdentifier = "com.example.client";
-  identity.entitlements = PlistDictionary{{kKSTEntitlementAllowed, true}};
-  fakes.codeSigningIdentity->setIdentityForPid(4242, identity);
-  platform::PeerCredentials peer;  // a root client
-  peer.pid = 4242;
-  auto connection = fakes.messageIPC->connect(peer);
+  auto connection = fakes.connectAllowedClient("com.example.client");
 
   platform::MessageDictionary stageRequest;
   stageRequest.setUint64("Command", 3);

@@ -290,14 +290,7 @@ TEST_F(DeathRowTest, MoveToDeathRowFailures) {
 
 TEST_F(DeathRowTest, CommandRepliesWithTheSweepsCodeOnceItEnded) {
   ASSERT_TRUE(KSTStartRequestListener(platform::DispatchQueue::createConcurrent("test.listener")));
-  platform::CodeSigningIdentityResult identity;
-  identity.signingIdentifier = "com.example.installer";
-  identity.entitlements = PlistDictionary{{kKSTEntitlementAllowed, true}};
-  fakes.codeSigningIdentity->setIdentityForPid(4242, identity);
-  platform::PeerCredentials peer;
-  peer.pid = 4242;
-  peer.uid = 0;
-  auto connection = fakes.messageIPC->connect(peer);
+  auto connection = fakes.connectAllowedClient();
   platform::MessageDictionary request;
   request.setUint64(kKSTCommandKey, 4);
 

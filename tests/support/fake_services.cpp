@@ -1,6 +1,7 @@
 #include "support/fake_services.h"
 
 #include "daemon/log.h"
+#include "daemon/request_dispatch.h"
 
 namespace kestrel::testing {
 
@@ -36,6 +37,21 @@ FakeServices::~FakeServices() {
   platform::installServices(platform::Services{});
 }
 
-void FakeServices::install() { platform::installServices(services); }
+void FakeServices::install() {
+  platform::installServices(services);
+}
+
+std::shared_ptr<platform::FakeMessageConnection> FakeServices::connectAllowedClient(
+    const std::string& identifier) {
+  constexpr pid_t kPid = 4242;
+  platform::CodeSigningIdentityResult identity;
+  identity.signingIdentifier = identifier;
+  identity.entitlements = PlistDictionary{{kKSTEntitlementAllowed, true}};
+  codeSigningIdentity->setIdentityForPid(kPid, identity);
+  platform::PeerCredentials peer;
+  peer.pid = kPid;
+  peer.uid = 0;
+  return messageIPC->connect(peer);
+}
 
 }  // namespace kestrel::testing

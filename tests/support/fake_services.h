@@ -3,6 +3,7 @@
 #pragma once
 
 #include <memory>
+#include <string>
 
 #include "platform/fake/fake_code_signing_identity.h"
 #include "platform/fake/fake_extended_acl.h"
@@ -25,6 +26,11 @@ class FakeServices {
 
   // Installs the current set again, after a test replaced one of them.
   void install();
+
+  // A root peer (pid 4242) that signs as `identifier` with the "allowed"
+  // entitlement, connected through the fake message IPC.
+  std::shared_ptr<platform::FakeMessageConnection> connectAllowedClient(
+      const std::string& identifier = "com.example.installer");
 
   ScratchRoot scratch;
   platform::Services services;
