@@ -102,6 +102,19 @@ void standardizeItem(const char* path, const struct stat& st, uid_t uid, gid_t g
   }
 }
 
+// Where a missing source counts as success (copy/move "if exists"): whether
+// it is there. A failed lstat is an error named after the calling operation.
+enum class SourceState { Present, Missing, Failed };
+SourceState sourceState(const char* function, int line, const KSTFileURL& url, KSTErrorRef* error) {
+  struct stat st {};
+  if (::lstat(url.fileSystemRepresentation(), &st) == 0) return SourceState::Present;
+  const int statError = errno;
+  if (statError == ENOENT) return SourceState::Missing;
+  KSTSetError(error, KSTCreatePOSIXError(function, line, statError, "stat of %@ failed: %s", url,
+                                         errnoText(statError)));
+  return SourceState::Failed;
+}
+
 }  // namespace
 
 KSTFileManager& KSTFileManager::defaultManager() {
@@ -193,14 +206,8 @@ bool KSTFileManager::createDirectoryAtURL(const KSTFileURL& url, bool withInterm
 bool KSTFileManager::_copyItemAtURL(const KSTFileURL& url, const KSTFileURL& toURL,
                                     bool failIfSrcMissing, KSTErrorRef* error) const {
   if (!failIfSrcMissing) {
-    struct stat st {};
-    if (::lstat(url.fileSystemRepresentation(), &st) != 0) {
-      const int statError = errno;
-      if (statError == ENOENT) return true;
-      KSTSetError(error,
-                  KST_POSIX_ERROR(statError, "stat of %@ failed: %s", url, errnoText(statError)));
-      return false;
-    }
+    const SourceState source = sourceState(__func__, __LINE__, url, error);
+    if (source != SourceState::Present) return source == SourceState::Missing;
   }
   const int copied =
       platform::copyTree(url.fileSystemRepresentation(), toURL.fileSystemRepresentation());
@@ -225,14 +232,8 @@ bool KSTFileManager::copyItemIfExistsAtURL(const KSTFileURL& url, const KSTFileU
 bool KSTFileManager::_moveItemAtURL(const KSTFileURL& url, const KSTFileURL& toURL,
                                     bool failIfSrcMissing, KSTErrorRef* error) const {
   if (!failIfSrcMissing) {
-    struct stat st {};
-    if (::lstat(url.fileSystemRepresentation(), &st) != 0) {
-      const int statError = errno;
-      if (statError == ENOENT) return true;
-      KSTSetError(error,
-                  KST_POSIX_ERROR(statError, "stat of %@ failed: %s", url, errnoText(statError)));
-      return false;
-    }
+    const SourceState source = sourceState(__func__, __LINE__, url, error);
+    if (source != SourceState::Present) return source == SourceState::Missing;
   }
   if (::rename(url.fileSystemRepresentation(), toURL.fileSystemRepresentation()) == 0) return true;
   const int renameError = errno;
