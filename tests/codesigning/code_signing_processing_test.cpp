@@ -64,11 +64,8 @@ class CodeSigningProcessingTest : public ::testing::Test {
           return *found;
         });
   }
-  std::size_t writes() const { return count("Wrote code signing mappings to disk after set"); }
-  std::size_t count(const std::string& message) const {
-    std::size_t n = 0;
-    for (const auto& line : fakes.logging->lines()) n += line.message == message ? 1 : 0;
-    return n;
+  std::size_t writes() const {
+    return fakes.countLogged("Wrote code signing mappings to disk after set");
   }
   std::size_t firstLineStartingWith(const std::string& prefix) const {
     const auto lines = fakes.logging->lines();
@@ -292,12 +289,6 @@ TEST_F(CodeSigningProcessingTest, CommandEighteenTakesDictionariesOnly) {
   EXPECT_EQ(run(PlistValue(PlistArray{"x"}), std::nullopt), kKSTSuccess);
   EXPECT_FALSE(entry("com.example.app"));
 }
-
-}  // namespace
-}  // namespace kestrel
-
-namespace kestrel {
-namespace {
 
 // Unchanged caller-registered entitlements are answered without the lock on
 // all identifiers: a request of such a client does not wait behind a

@@ -74,13 +74,6 @@ class GroupManagerTest : public ::testing::Test {
     const KSTMetadataRef found = find(user, containerClass, group);
     return found && std::filesystem::exists(found->url().path());
   }
-  bool loggedEnding(const std::string& text) const {
-    for (const auto& line : fakes.logging->lines()) {
-      if (line.message.ends_with(text)) return true;
-    }
-    return false;
-  }
-
   testing::FakeServices fakes;
   KSTClientConnection installer{std::string("com.example.installer"), 0, true, std::nullopt};
 };
@@ -140,7 +133,8 @@ TEST_F(GroupManagerTest, MissingIdentifierFailsWith11BeforeAnyLock) {
   asker.join();
   ASSERT_TRUE(inTime) << "the lookups waited for the lock";
   EXPECT_EQ(answer.get(), std::make_pair(std::uint64_t{11}, std::uint64_t{11}));
-  EXPECT_TRUE(loggedEnding(": Can't act on an invalid object: userId: 501, ID: (null)"));
+  EXPECT_TRUE(fakes.logged(": Can't act on an invalid object: userId: 501, ID: (null)",
+                           testing::Match::Suffix));
 }
 
 TEST_F(GroupManagerTest, LastReferenceGoingAwayRemovesTheGroupForEveryUser) {

@@ -369,11 +369,8 @@ TEST_F(SystemContainerACLsTest, EveryContainerOfAClassDirectory) {
   EXPECT_EQ(service->aclAt(path("Data/System/A")).has_value() +
                 service->aclAt(path("Data/System/B")).has_value(),
             1);
-  int failuresLogged = 0;
-  for (const auto& line : fakes.logging->lines()) {
-    failuresLogged += line.message.starts_with("Failed to set system container ACL at ");
-  }
-  EXPECT_EQ(failuresLogged, 1);
+  EXPECT_EQ(fakes.countLogged("Failed to set system container ACL at ", testing::Match::Prefix),
+            1u);
 }
 
 }  // namespace

@@ -2,33 +2,11 @@
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <optional>
 #include <string>
-#include <vector>
 
 namespace kestrel {
 namespace {
-
-std::vector<std::string> sorted(std::vector<std::string> v) {
-  std::sort(v.begin(), v.end());
-  return v;
-}
-
-TEST(WhitelistTest, ListsExactlyTheFixedTables) {
-  const KSTWhitelist& whitelist = KSTWhitelist::sharedWhitelist();
-  EXPECT_EQ(&whitelist, &KSTWhitelist::sharedWhitelist());
-  EXPECT_EQ(sorted(whitelist.wellknownSystemContainers()),
-            (std::vector<std::string>{"com.zorvane.egretd", "com.zorvane.ternd"}));
-  EXPECT_EQ(sorted(whitelist.wellknownSystemGroupContainers()),
-            (std::vector<std::string>{
-                "systemgroup.com.zorvane.heron.tiles", "systemgroup.com.zorvane.ibis.profiles",
-                "systemgroup.com.zorvane.marten.managed", "systemgroup.com.zorvane.plover.info"}));
-  // Every identifier is its own directory name.
-  for (const auto* mapping : {&whitelist.systemWhitelist(), &whitelist.systemGroupWhitelist()}) {
-    for (const auto& [identifier, directoryName] : *mapping) EXPECT_EQ(identifier, directoryName);
-  }
-}
 
 TEST(WhitelistTest, AnswersByClassAndComparesExactly) {
   struct Row {

@@ -185,12 +185,10 @@ TEST_F(CommandRequestsTest, UserIdsAreCheckedAgainstTheCommandsClass) {
     std::uint32_t clientUser;
     std::optional<std::uint32_t> resolved;  // nullopt: 38
   } rows[] = {
-      {"bundle class refuses 501", create, 1, 501, 0, std::nullopt},
       {"bundle class takes the installer", create, 1, 33, 0, 33},
       {"system client: 1 is the current mobile user", create, 2, 1, 0, 501},
       {"only the low 32 bits count", create, 2, (std::uint64_t{7} << 32) | 502, 0, 502},
       {"mobile client names another user", create, 2, 502, 501, std::nullopt},
-      {"mobile client names 1", create, 2, 1, 502, 502},
       {"wipe ignores the request's class (4)", wipePlugin, 1, 501, 0, 501},
       {"wipe checks against class 4", wipePlugin, 2, 33, 0, std::nullopt},
       {"app groups check against class 7", appGroup, 1, 501, 0, 501},

@@ -90,18 +90,10 @@ LockHolder::Body allIdentifiersLock(bool forWriting) {
 
 class LocksConcurrencyTest : public ::testing::Test {
  protected:
-  std::size_t countLines(std::string_view tag, std::string_view message) const {
-    std::size_t count = 0;
-    for (const auto& line : fakes.logging->lines()) {
-      if (line.tag == tag && line.message == message) ++count;
-    }
-    return count;
-  }
-
   // Waits until a locker has announced that it waits (its counts are raised by then).
   bool waitForLine(std::string_view tag, std::string_view message, std::size_t count = 1) const {
     const auto deadline = std::chrono::steady_clock::now() + kPatience;
-    while (countLines(tag, message) < count) {
+    while (fakes.countLogged(message, testing::Match::Exact, tag) < count) {
       if (std::chrono::steady_clock::now() > deadline) return false;
       std::this_thread::sleep_for(1ms);
     }
@@ -137,12 +129,17 @@ TEST_F(LocksConcurrencyTest, WriterWaitsForBothReadersAndTheRecordGoesWithTheLas
 
   reader2.release();
   ASSERT_TRUE(writer.waitAcquired());
-  EXPECT_EQ(countLines("unlock_one_lock", "Destroying lock for identifier X"), 0u);
+  EXPECT_EQ(fakes.countLogged("Destroying lock for identifier X", testing::Match::Exact,
+                              "unlock_one_lock"),
+            0u);
 
   writer.release();
   EXPECT_EQ(KSTLocksLiveRecordCount(), 0u);
-  EXPECT_EQ(countLines("unlock_one_lock", "Unlocked identifier X"), 3u);
-  EXPECT_EQ(countLines("unlock_one_lock", "Destroying lock for identifier X"), 1u);
+  EXPECT_EQ(fakes.countLogged("Unlocked identifier X", testing::Match::Exact, "unlock_one_lock"),
+            3u);
+  EXPECT_EQ(fakes.countLogged("Destroying lock for identifier X", testing::Match::Exact,
+                              "unlock_one_lock"),
+            1u);
 }
 
 TEST_F(LocksConcurrencyTest, WaitingAllWriterDoesNotHoldBackNewReadersButAHeldOneDoes) {

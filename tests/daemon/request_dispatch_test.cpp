@@ -2,8 +2,6 @@
 
 #include <gtest/gtest.h>
 
-#include <chrono>
-
 #include "codesigning/code_signing_mapping.h"
 #include "daemon/daemon_state.h"
 #include "daemon/error_codes.h"
@@ -13,7 +11,6 @@
 namespace kestrel {
 namespace {
 
-using namespace std::chrono_literals;
 using platform::MessageDictionary;
 
 constexpr pid_t kClientPid = 4242;
@@ -21,12 +18,13 @@ constexpr pid_t kClientPid = 4242;
 class RequestDispatchTest : public ::testing::Test {
  protected:
   RequestDispatchTest() {
-    EXPECT_TRUE(KSTStartRequestListener(platform::DispatchQueue::createConcurrent("test.listener")));
+    EXPECT_TRUE(
+        KSTStartRequestListener(platform::DispatchQueue::createConcurrent("test.listener")));
   }
 
-  std::shared_ptr<platform::FakeMessageConnection> connect(uid_t uid,
-                                                           std::optional<PlistDictionary> entitlements,
-                                                           std::optional<std::string> identifier = "com.example.client") {
+  std::shared_ptr<platform::FakeMessageConnection> connect(
+      uid_t uid, std::optional<PlistDictionary> entitlements,
+      std::optional<std::string> identifier = "com.example.client") {
     platform::CodeSigningIdentityResult identity;
     identity.signingIdentifier = std::move(identifier);
     identity.entitlements = std::move(entitlements);
@@ -53,22 +51,6 @@ class RequestDispatchTest : public ::testing::Test {
   testing::FakeServices fakes;
   std::shared_ptr<platform::FakeMessageConnection> connection;
 };
-
-TEST_F(RequestDispatchTest, CommandTableHasEveryRowInPlace) {
-  const auto& table = KSTCommandTable();
-  const std::map<std::uint64_t, std::string> special = {
-      {11, kKSTEntitlementWipeContainer}, {24, kKSTEntitlementDataMigration},
-      {26, kKSTEntitlementStageSharedContent}, {0, kKSTEntitlementNone},
-      {13, kKSTEntitlementNone}, {15, kKSTEntitlementNone}, {16, kKSTEntitlementNone},
-      {17, kKSTEntitlementNone}};
-  for (std::uint64_t i = 0; i < table.size(); ++i) {
-    SCOPED_TRACE(i);
-    EXPECT_EQ(table[i].index, i);
-    auto it = special.find(i);
-    EXPECT_STREQ(table[i].entitlement, it == special.end() ? kKSTEntitlementAllowed : it->second.c_str());
-    EXPECT_EQ(table[i].replyFlag, (i == 4 || i == 21) ? 0 : 1);
-  }
-}
 
 TEST_F(RequestDispatchTest, AdmissionFollowsTheEntitlements) {
   const PlistDictionary none;
@@ -108,7 +90,8 @@ TEST_F(RequestDispatchTest, AdmissionFollowsTheEntitlements) {
     connect(501, row.entitlements);
     for (std::uint64_t command = 0; command < kKSTCommandCount; ++command) {
       SCOPED_TRACE(command);
-      const bool expected = std::find(row.admitted.begin(), row.admitted.end(), command) != row.admitted.end();
+      const bool expected =
+          std::find(row.admitted.begin(), row.admitted.end(), command) != row.admitted.end();
       EXPECT_EQ(admit(command) != nullptr, expected);
     }
   }
@@ -149,7 +132,8 @@ TEST_F(RequestDispatchTest, RefusalsAndUnreadableIdentifiersAreLogged) {
   auto client = admit(0);
   ASSERT_NE(client, nullptr);  // admitted, acting with no own identifier
   EXPECT_FALSE(client->clientBundleIdentifier().has_value());
-  EXPECT_TRUE(fakes.logging->containsMessage("Failed to copy signing ID for pid 4242 : not signed"));
+  EXPECT_TRUE(
+      fakes.logging->containsMessage("Failed to copy signing ID for pid 4242 : not signed"));
 }
 
 TEST_F(RequestDispatchTest, UserIdsResolveByClassAndClient) {
@@ -189,7 +173,8 @@ TEST_F(RequestDispatchTest, UserIdsResolveByClassAndClient) {
       EXPECT_EQ(code, kKSTErrorInvalidParameter);
     }
   }
-  EXPECT_TRUE(fakes.logging->contains("validateUserId", "Invalid userId 502 for class 2 from client 501"));
+  EXPECT_TRUE(
+      fakes.logging->contains("validateUserId", "Invalid userId 502 for class 2 from client 501"));
   fakes.logging->clear();
   EXPECT_FALSE(validateUserId(502, 2, 501, nullptr, nullptr));
   EXPECT_TRUE(fakes.logging->lines().empty());  // no code pointer: no log line
@@ -231,8 +216,8 @@ TEST_F(RequestDispatchTest, RetryTestOnACustomerBuildAnswersSuccessAndDoesNothin
   ASSERT_TRUE(reply.has_value());
   EXPECT_EQ(reply->uint64("ReplyError"), kKSTSuccess);
   EXPECT_FALSE(connection->cancelled());
-  EXPECT_TRUE(fakes.logging->contains("retryTest",
-                                      "People really shouldn't be calling this on non-internal installs!"));
+  EXPECT_TRUE(fakes.logging->contains(
+      "retryTest", "People really shouldn't be calling this on non-internal installs!"));
 
   message.setUint64("UserID", 502);  // another user's: refused by the user-id check
   ASSERT_TRUE(connection->deliver(message));

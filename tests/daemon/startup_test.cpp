@@ -128,8 +128,9 @@ TEST_F(StartupTest, UnopenableLogIsReportedToTheSystemLogAndStartGoesOn) {
   ASSERT_EQ(KSTDaemonStart(hooks), 0);
   const auto syslog = fakes.logging->systemLog();
   ASSERT_EQ(syslog.size(), 1u);
-  EXPECT_EQ(syslog[0], "Failed to set up rotating logs at path " +
-                           fakes.scratch.resolve("/private/var/root/Library/Logs/Kestrel/kestreld.log"));
+  EXPECT_EQ(syslog[0],
+            "Failed to set up rotating logs at path " +
+                fakes.scratch.resolve("/private/var/root/Library/Logs/Kestrel/kestreld.log"));
   EXPECT_TRUE(fakes.logging->diskLogging().empty());
 }
 
@@ -157,8 +158,9 @@ TEST_F(StartupTest, FailuresThatDoNotStopStartUpAreLogged) {
   fakes.keyBag->setRegistrationStatus(5);
   listenerStarts = false;
   ASSERT_EQ(KSTDaemonStart(hooks), 0);
-  EXPECT_TRUE(fakes.logging->contains("set_first_boot_work_completed",
-                                      "Failed to create semaphore kestreld.fb_check: Permission denied"));
+  EXPECT_TRUE(
+      fakes.logging->contains("set_first_boot_work_completed",
+                              "Failed to create semaphore kestreld.fb_check: Permission denied"));
   EXPECT_TRUE(logged("Failed to register for com.zorvane.keybag.lock-status: 5"));
   EXPECT_TRUE(logged("unable to start vexel service!"));
 
@@ -194,39 +196,24 @@ TEST_F(StartupTest, LockedDeviceHoldsTheLockStateQueueUntilTheLockStateFileSaysU
   EXPECT_FALSE(KSTIsLocked());
 }
 
-TEST_F(StartupTest, LockStatesOtherThanLockedOrUnlockedChangeNothing) {
+// States other than locked (1) or unlocked (0) change nothing; repeated
+// notifications keep the queue's suspends and resumes balanced.
+TEST_F(StartupTest, LockNotificationsFollowOnlyLockedAndUnlocked) {
   fakes.keyBag->setLockState(1);
   ASSERT_EQ(KSTDaemonStart(hooks), 0);
   ASSERT_TRUE(KSTIsLocked());
-
-  fakes.keyBag->setLockState(2);
-  fakes.keyBag->notifyLockStatusChanged();
-  drainMainQueue();
-  EXPECT_TRUE(KSTIsLocked());
-
-  fakes.keyBag->setLockState(0);
-  fakes.keyBag->notifyLockStatusChanged();
-  drainMainQueue();
-  EXPECT_FALSE(KSTIsLocked());
-
-  fakes.keyBag->setLockState(-1);
-  fakes.keyBag->notifyLockStatusChanged();
-  drainMainQueue();
-  EXPECT_FALSE(KSTIsLocked());
-  // Still running: work queued now runs.
-  std::atomic<bool> ran{false};
-  KSTLockStateQueue()->sync([&] { ran = true; });
-  EXPECT_TRUE(ran);
-}
-
-TEST_F(StartupTest, RepeatedLockNotificationsKeepSuspendAndResumeBalanced) {
-  ASSERT_EQ(KSTDaemonStart(hooks), 0);
-  for (int state : {1, 1, 1, 0, 0, 1, 0}) {
-    fakes.keyBag->setLockState(state);
+  const struct {
+    int state;
+    bool locked;
+  } steps[] = {{2, true}, {0, false}, {-1, false}, {1, true}, {1, true},
+               {1, true}, {0, false}, {0, false},  {1, true}, {0, false}};
+  for (const auto& step : steps) {
+    SCOPED_TRACE(step.state);
+    fakes.keyBag->setLockState(step.state);
     fakes.keyBag->notifyLockStatusChanged();
     drainMainQueue();
+    EXPECT_EQ(KSTIsLocked(), step.locked);
   }
-  EXPECT_FALSE(KSTIsLocked());
   std::atomic<bool> ran{false};
   KSTLockStateQueue()->sync([&] { ran = true; });  // would hang if a suspend were left over
   EXPECT_TRUE(ran);

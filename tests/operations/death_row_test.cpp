@@ -50,15 +50,6 @@ class DeathRowTest : public ::testing::Test {
     }
   }
 
-  // A log line with the tag (any, when empty) whose message holds the text.
-  bool logged(std::string_view tag, std::string_view text) const {
-    for (const auto& line : fakes.logging->lines()) {
-      if ((tag.empty() || line.tag == tag) && line.message.find(text) != std::string::npos)
-        return true;
-    }
-    return false;
-  }
-
   std::string deathRow() {
     return KSTGlobalConfiguration::sharedInstance().deathrowDirectory().path();
   }
@@ -148,7 +139,7 @@ TEST_F(DeathRowTest, SweepOfAnAbsentOrUnreadableDeathRow) {
   fs::remove_all(path);
   std::ofstream(path) << "not a directory";
   EXPECT_EQ(sweep(), kKSTErrorDeleteFailed);
-  EXPECT_TRUE(logged("", "Failed to get items for deletion: " + path + " : "));
+  EXPECT_TRUE(fakes.logged("Failed to get items for deletion: " + path + " : "));
   EXPECT_TRUE(fs::is_regular_file(path));
 }
 
@@ -162,8 +153,8 @@ TEST_F(DeathRowTest, EntryThatCannotBeRemovedGoesToTmp) {
   EXPECT_TRUE(entries(deathRow()).empty());
   EXPECT_TRUE(fs::exists(tmp() + "/stuck/Library/stuck.db"));
   EXPECT_FALSE(fs::exists(tmp() + "/other"));
-  EXPECT_TRUE(logged("_removeItemOrMoveToTempAtURL",
-                     "Couldn't remove, so moving item to /tmp: " + deathRow() + "/stuck : "));
+  EXPECT_TRUE(fakes.logged("Couldn't remove, so moving item to /tmp: " + deathRow() + "/stuck : ",
+                           testing::Match::Contains, "_removeItemOrMoveToTempAtURL"));
 }
 
 TEST_F(DeathRowTest, EntryThatCanNeitherBeRemovedNorMovedFailsTheSweepButNotTheOthers) {
@@ -176,7 +167,7 @@ TEST_F(DeathRowTest, EntryThatCanNeitherBeRemovedNorMovedFailsTheSweepButNotTheO
 
   EXPECT_EQ(sweep(), kKSTErrorDestroyFailed);
   EXPECT_EQ(entries(deathRow()), std::vector<std::string>{"stuck"});
-  EXPECT_TRUE(logged("", "Failed to destroy item at: " + deathRow() + "/stuck"));
+  EXPECT_TRUE(fakes.logged("Failed to destroy item at: " + deathRow() + "/stuck"));
 
   // The next sweep finds the entry again, and takes it once it can.
   setAppendOnly(deathRow() + "/stuck/Library/stuck.db", false);

@@ -292,37 +292,6 @@ TEST(CodeSigningIdentityTest, IdentifiesPeersFromTheRegistry) {
   }
 }
 
-TEST(CodeSigningIdentityTest, EntitlementsKeepEveryValueType) {
-  Registry registry;
-  registry.writeEntry("gamma.plist",
-                      entry("com.example.gamma", "Executable", registry.client("gamma"),
-                            "<key>flag</key><false/>"
-                            "<key>count</key><integer>42</integer>"
-                            "<key>offset</key><integer>-3</integer>"
-                            "<key>ratio</key><real>0.5</real>"
-                            "<key>name</key><string>x &amp; y</string>"
-                            "<key>blob</key><data>AAEC/w==</data>"
-                            "<key>when</key><date>2001-01-01T00:01:00Z</date>"
-                            "<key>groups</key><array><string>a</string><string>b</string></array>"
-                            "<key>nested</key><dict><key>inner</key><true/></dict>"));
-  const CodeSigningIdentityResult result = LinuxCodeSigningIdentity(registry.scratch.root())
-                                               .identify(registry.peer(registry.client("gamma")));
-  const PlistDictionary expected{
-      {"flag", false},
-      {"count", 42},
-      {"offset", -3},
-      {"ratio", 0.5},
-      {"name", "x & y"},
-      {"blob", PlistData{0, 1, 2, 255}},
-      {"when", PlistDate{60}},
-      {"groups", PlistArray{"a", "b"}},
-      {"nested", PlistDictionary{{"inner", true}}},
-  };
-  ASSERT_TRUE(result.entitlements.has_value()) << result.error;
-  EXPECT_EQ(PlistValue(*result.entitlements), PlistValue(expected))
-      << PlistValue(*result.entitlements).description();
-}
-
 TEST(CodeSigningIdentityTest, ChangesToTheRegistryAreSeenByTheNextLookup) {
   Registry registry;
   LinuxCodeSigningIdentity identity(registry.scratch.root());
@@ -375,7 +344,7 @@ TEST(CodeSigningIdentityTest, ChangesToTheRegistryAreSeenByTheNextLookup) {
   }
 }
 
-TEST(CodeSigningIdentityTest, ConcurrentLookupsWhileTheRegistryChanges) {
+TEST(CodeSigningIdentityConcurrencyTest, LookupsWhileTheRegistryChanges) {
   Registry registry;
   LinuxCodeSigningIdentity identity(registry.scratch.root());
   const PeerCredentials alpha = registry.peer(registry.client("alpha"));
@@ -402,12 +371,6 @@ TEST(CodeSigningIdentityTest, ConcurrentLookupsWhileTheRegistryChanges) {
   EXPECT_EQ(unexpected, 0);
   EXPECT_EQ(identity.identify(alpha).signingIdentifier, "com.example.alpha");
 }
-
-}  // namespace
-}  // namespace kestrel::platform
-
-namespace kestrel::platform {
-namespace {
 
 // A damaged file (here a binary list whose string holds a NUL byte, which
 // libplist itself asserts on) is refused like any unreadable one; the other

@@ -4,10 +4,10 @@
 #include <chrono>
 #include <condition_variable>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
-#include "platform/fake/fake_platform.h"
 #include "platform/linux/key_bag_linux.h"
 #include "support/scratch_root.h"
 
@@ -108,10 +108,11 @@ TEST(KeyBagTest, RegistrationFailsWithAnErrnoWhenTheStateDirectoryCannotBeMade) 
             ENOTDIR);
 }
 
+// Without the multi-user file the device is single-user and has no session list.
 TEST(KeyBagTest, TheMultiUserFileSetsTheModeAndListsTheSessions) {
   struct Row {
-    const char* content;
-    std::optional<std::vector<std::uint32_t>> expected;  // nullopt: an error naming the file
+    const char* content;                                 // nullptr: no file
+    std::optional<std::vector<std::uint32_t>> expected;  // nullopt: an error
   };
   const Row rows[] = {
       {"501\n", std::vector<std::uint32_t>{501}},
@@ -124,57 +125,25 @@ TEST(KeyBagTest, TheMultiUserFileSetsTheModeAndListsTheSessions) {
       {"+501", std::nullopt},
       {"4294967296", std::nullopt},
       {"501,502", std::nullopt},
+      {nullptr, std::nullopt},
   };
   for (const Row& row : rows) {
-    SCOPED_TRACE("\"" + std::string(row.content) + "\"");
+    SCOPED_TRACE(row.content != nullptr ? "\"" + std::string(row.content) + "\"" : "no file");
     ScratchRoot scratch;
-    scratch.writeFile(kMultiUser, row.content);
+    if (row.content != nullptr) scratch.writeFile(kMultiUser, row.content);
     LinuxKeyBag keyBag(scratch.root());
     ASSERT_TRUE(keyBag.userTypeInfo().has_value());
-    EXPECT_EQ(keyBag.userTypeInfo()->deviceMode, DeviceMode::MultiUser);
+    EXPECT_EQ(keyBag.userTypeInfo()->deviceMode,
+              row.content != nullptr ? DeviceMode::MultiUser : DeviceMode::SingleUser);
     std::string error;
     EXPECT_EQ(keyBag.userSessionIds(&error), row.expected);
     if (!row.expected) {
-      EXPECT_NE(error.find(scratch.resolve(kMultiUser)), std::string::npos) << error;
+      EXPECT_FALSE(error.empty());
+      if (row.content != nullptr) {
+        EXPECT_NE(error.find(scratch.resolve(kMultiUser)), std::string::npos) << error;
+      }
     }
   }
-}
-
-TEST(KeyBagTest, WithoutTheMultiUserFileTheDeviceIsSingleUser) {
-  ScratchRoot scratch;
-  LinuxKeyBag keyBag(scratch.root());
-  ASSERT_TRUE(keyBag.userTypeInfo().has_value());
-  EXPECT_EQ(keyBag.userTypeInfo()->deviceMode, DeviceMode::SingleUser);
-  std::string error;
-  EXPECT_FALSE(keyBag.userSessionIds(&error).has_value());
-  EXPECT_FALSE(error.empty());
-}
-
-TEST(KeyBagTest, TheFakePostsItsHandlersToTheirQueuesUnlessRegistrationFails) {
-  FakeKeyBag keyBag;
-  const auto queue = DispatchQueue::createSerial("fake-key-bag-test");
-  keyBag.setRegistrationStatus(EIO);
-  EXPECT_EQ(keyBag.registerLockStatusNotification(queue, [] {}), EIO);
-  EXPECT_EQ(keyBag.registrationCount(), 0U);
-
-  keyBag.setRegistrationStatus(0);
-  std::mutex mutex;
-  std::condition_variable ran;
-  bool done = false;
-  bool onQueue = false;
-  ASSERT_EQ(keyBag.registerLockStatusNotification(queue,
-                                                  [&] {
-                                                    std::lock_guard lock(mutex);
-                                                    onQueue = queue->isCurrent();
-                                                    done = true;
-                                                    ran.notify_all();
-                                                  }),
-            0);
-  EXPECT_EQ(keyBag.registeredQueue(), queue);
-  keyBag.notifyLockStatusChanged();
-  std::unique_lock lock(mutex);
-  ASSERT_TRUE(ran.wait_for(lock, 10s, [&] { return done; }));
-  EXPECT_TRUE(onQueue);
 }
 
 }  // namespace

@@ -108,9 +108,13 @@ TEST(PlistSerializationTest, ReadsXml) {
   <key>Minus</key><integer>-1</integer>
   <key>Big</key><integer>18446744073709551615</integer>
   <key>Flag</key><true/>
-  <key>Blob</key><data>AAEC</data>
+  <key>Off</key><false/>
+  <key>Ratio</key><real>0.5</real>
+  <key>Escaped</key><string>x &amp; y</string>
+  <key>Blob</key><data>AAEC/w==</data>
   <key>When</key><date>2001-01-01T00:00:10Z</date>
   <key>Empty</key><array/>
+  <key>Nested</key><dict><key>Inner</key><array><string>a</string></array></dict>
 </dict>
 </plist>)";
   std::string error;
@@ -121,9 +125,13 @@ TEST(PlistSerializationTest, ReadsXml) {
       {"Minus", std::int64_t{-1}},
       {"Big", std::numeric_limits<std::uint64_t>::max()},
       {"Flag", true},
-      {"Blob", PlistData{0, 1, 2}},
+      {"Off", false},
+      {"Ratio", 0.5},
+      {"Escaped", "x & y"},
+      {"Blob", PlistData{0, 1, 2, 255}},
       {"When", PlistDate{10}},
       {"Empty", PlistArray{}},
+      {"Nested", PlistDictionary{{"Inner", PlistArray{"a"}}}},
   };
   EXPECT_EQ(*value, expected) << value->description();
 }

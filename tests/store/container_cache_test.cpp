@@ -60,18 +60,6 @@ class ContainerCacheTest : public ::testing::Test {
     return sorted;
   }
 
-  std::size_t linesWithMessage(std::string_view message) const {
-    std::size_t count = 0;
-    for (const auto& line : fakes.logging->lines()) count += line.message == message;
-    return count;
-  }
-  bool loggedContaining(std::string_view text) const {
-    for (const auto& line : fakes.logging->lines()) {
-      if (line.message.find(text) != std::string::npos) return true;
-    }
-    return false;
-  }
-
   testing::FakeServices fakes;
 };
 
@@ -104,7 +92,7 @@ TEST_F(ContainerCacheTest, RebuildFromAJunkFilledDirectoryKeepsOnlyValidContaine
   auto all = cache().allContainersForUser(501, 2, false, nullptr);
   ASSERT_TRUE(all);
   EXPECT_EQ(all->size(), 2u);
-  EXPECT_EQ(linesWithMessage("Rebuilding container class cache: 501-Data/Application"), 1u);
+  EXPECT_EQ(fakes.countLogged("Rebuilding container class cache: 501-Data/Application"), 1u);
 }
 
 TEST_F(ContainerCacheTest, LookupFindsTheRecordItHoldsAndSaysWhyWhenItCannot) {
@@ -167,7 +155,7 @@ TEST_F(ContainerCacheTest, LookupFindsTheRecordItHoldsAndSaysWhyWhenItCannot) {
     EXPECT_EQ(error->code(), row.code);
     EXPECT_EQ(messageOf(error), row.message);
     EXPECT_EQ(messageOf(error->underlyingError()), row.underlying);
-    EXPECT_EQ(loggedContaining(row.message), row.logged);
+    EXPECT_EQ(fakes.logged(row.message), row.logged);
   }
 }
 
@@ -346,7 +334,7 @@ TEST_F(ContainerCacheTest, ExceptionBecomesError40AndReleasesTheLock) {
   EXPECT_EQ(error->code(), 40);
   EXPECT_EQ(messageOf(error).rfind("Got exception: account database unreachable : ", 0), 0u)
       << messageOf(error);
-  EXPECT_TRUE(loggedContaining("Got exception: account database unreachable : "));
+  EXPECT_TRUE(fakes.logged("Got exception: account database unreachable : "));
 
   EXPECT_FALSE(cache().removeContainerForUser(777, 2, "com.example.app", false, &error));
   EXPECT_EQ(error->code(), 40);
@@ -407,7 +395,7 @@ TEST_F(ContainerCacheConcurrencyTest, ManyThreadsLookUpAddAndRemoveTogether) {
     for (bool transient : {false, true}) {
       const std::string key =
           std::to_string(user) + "-Data/Application" + (transient ? "(transient)" : "");
-      EXPECT_EQ(linesWithMessage("Rebuilding container class cache: " + key), 1u) << key;
+      EXPECT_EQ(fakes.countLogged("Rebuilding container class cache: " + key), 1u) << key;
     }
   }
   std::size_t expected = 0;

@@ -53,12 +53,6 @@ class LayoutTest : public ::testing::Test {
     }
     return false;
   }
-  std::size_t countStartingWith(const std::string& prefix) const {
-    std::size_t count = 0;
-    for (const auto& line : fakes.logging->lines()) count += line.message.rfind(prefix, 0) == 0;
-    return count;
-  }
-
   testing::FakeServices fakes;
 };
 
@@ -270,7 +264,8 @@ TEST_F(LayoutTest, TransientBundleLevelsAreMadeOneByOneWithoutParents) {
   fs::remove(sys("/private/var/tesseld"));
   const std::string expected = sys("/private/var/tesseld/Library/Caches/com.zorvane.kestreld");
   EXPECT_EQ(global().transientBundleDirectory().path(), expected);
-  EXPECT_EQ(countStartingWith("Failed to create transient bundle dir at "), 3u);
+  EXPECT_EQ(fakes.countLogged("Failed to create transient bundle dir at ", testing::Match::Prefix),
+            3u);
   EXPECT_FALSE(fs::exists(sys("/private/var/tesseld")));
 
   // Once the installer's home is there, the next call makes the levels.
@@ -300,7 +295,9 @@ TEST_F(LayoutTest, MigrationFileExistsForAnyItemInTheLibraryDirectory) {
   EXPECT_FALSE(global().migrationFileExistsWithName("kst_group_id_migration_complete.plist"));
 }
 
-TEST_F(LayoutTest, ConcurrentCallersShareOneConfigurationPerUser) {
+using LayoutConcurrencyTest = LayoutTest;
+
+TEST_F(LayoutConcurrencyTest, CallersShareOneConfigurationPerUser) {
   constexpr int kThreads = 8;
   std::vector<std::shared_ptr<KSTPerUserConfiguration>> seen(kThreads);
   std::vector<std::thread> threads;

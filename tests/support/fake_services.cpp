@@ -54,4 +54,28 @@ std::shared_ptr<platform::FakeMessageConnection> FakeServices::connectAllowedCli
   return messageIPC->connect(peer);
 }
 
+std::size_t FakeServices::countLogged(std::string_view text, Match match,
+                                      std::string_view tag) const {
+  std::size_t count = 0;
+  for (const auto& line : logging->lines()) {
+    if (!tag.empty() && line.tag != tag) continue;
+    const std::string_view message = line.message;
+    switch (match) {
+      case Match::Exact:
+        count += message == text;
+        break;
+      case Match::Contains:
+        count += message.find(text) != std::string_view::npos;
+        break;
+      case Match::Prefix:
+        count += message.starts_with(text);
+        break;
+      case Match::Suffix:
+        count += message.ends_with(text);
+        break;
+    }
+  }
+  return count;
+}
+
 }  // namespace kestrel::testing

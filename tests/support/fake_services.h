@@ -2,8 +2,10 @@
 // test's process; the log is closed and the services removed again at the end.
 #pragma once
 
+#include <cstddef>
 #include <memory>
 #include <string>
+#include <string_view>
 
 #include "platform/fake/fake_code_signing_identity.h"
 #include "platform/fake/fake_extended_acl.h"
@@ -16,6 +18,9 @@
 #include "support/scratch_root.h"
 
 namespace kestrel::testing {
+
+// How a logged message is compared with the text looked for.
+enum class Match { Exact, Contains, Prefix, Suffix };
 
 class FakeServices {
  public:
@@ -31,6 +36,14 @@ class FakeServices {
   // entitlement, connected through the fake message IPC.
   std::shared_ptr<platform::FakeMessageConnection> connectAllowedClient(
       const std::string& identifier = "com.example.installer");
+
+  // Log lines whose message matches the text (and whose tag is `tag`, unless empty).
+  std::size_t countLogged(std::string_view text, Match match = Match::Exact,
+                          std::string_view tag = {}) const;
+  bool logged(std::string_view text, Match match = Match::Contains,
+              std::string_view tag = {}) const {
+    return countLogged(text, match, tag) > 0;
+  }
 
   ScratchRoot scratch;
   platform::Services services;

@@ -19,7 +19,12 @@ TEST_F(KestrelctlEndToEndTest, NamedSubcommandsPrintForPeopleOrAsJson) {
   ASSERT_TRUE(daemon.ready());
   const std::string deathRow = scratch.resolve(kDeathRow);
 
-  scratch.writeFile(std::string(kDeathRow) + "/temp.a1b2c3/Documents/a", "a");
+  scratch.writeFile(std::string(kDeathRow) + "/temp.a1b2c3/Data/Library/Preferences/a.plist", "a");
+  scratch.writeFile(std::string(kDeathRow) + "/5F1C0E2A-UUID/Documents/b", "b");
+  auto refused = ctl("plain-client", {"sweep"});
+  EXPECT_EQ(refused.exitStatus, 4) << refused.output;
+  EXPECT_FALSE(fs::is_empty(deathRow));
+
   auto swept = ctl("allowed-client", {"sweep"});
   EXPECT_EQ(swept.exitStatus, 0) << swept.output;
   EXPECT_EQ(swept.output, "death row swept\n");
@@ -30,9 +35,6 @@ TEST_F(KestrelctlEndToEndTest, NamedSubcommandsPrintForPeopleOrAsJson) {
   EXPECT_EQ(json.exitStatus, 0) << json.output;
   EXPECT_EQ(json.output, "{\n  \"ReplyError\": 1\n}\n");
   EXPECT_TRUE(fs::is_empty(deathRow));
-
-  auto refused = ctl("plain-client", {"sweep"});
-  EXPECT_EQ(refused.exitStatus, 4) << refused.output;
 
   auto unknown = ctl("allowed-client", {"code-signing-info", "--identifier", "com.example.none"});
   EXPECT_EQ(unknown.exitStatus, 1) << unknown.output;
