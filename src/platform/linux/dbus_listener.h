@@ -8,11 +8,10 @@
 // -> "/com/zorvane/kestreld"), and org.freedesktop.DBus.Hello, so that
 // ordinary clients (busctl --address=unix:path=..., gdbus) can talk to it.
 //
-// One thread owns every sd-bus object: it accepts, reads each peer's
-// credentials right at accept, decodes requests and sends replies. Requests of
-// one connection go in order to a serial queue of its own, targeted at the
-// listener's queue; replies made on any thread are handed back to the IPC
-// thread through an eventfd.
+// One thread accepts connections and reads each peer's credentials right at
+// accept; every connection is then served on a thread of its own, which reads
+// its requests and runs the handler for each, in order, as an item of the
+// listener's queue (see dbus_peer_session.h).
 #pragma once
 
 #include <memory>
