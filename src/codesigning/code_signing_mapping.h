@@ -170,6 +170,12 @@ class KSTCodeSigningMapping {
   // processed again, so the lock on all identifiers is not taken for them.
   std::uint64_t processCallerRegisteredEntitlements(
       const PlistDictionary& entitlements, const std::optional<std::string>& forIdentifier);
+  // Admission's question, in one visit to the queue: the identifier has no
+  // information, or registered its own, and `entitlements` are not what its
+  // entry holds already. True as well when the store is unavailable, so that
+  // the processing reports it.
+  bool callerRegisteredEntitlementsNeedProcessing(const PlistDictionary& entitlements,
+                                                  const std::string& identifier);
 
   bool codeSigningInfoExistForIdentifier(std::string_view identifier);
   bool identifierHasCallerRegisteredEntitlements(std::string_view identifier);

@@ -215,6 +215,18 @@ bool KSTCodeSigningMappingState::_onQueue_callerRegisteredInfoIsCurrent(
   return entry.isEqual(*old);
 }
 
+bool KSTCodeSigningMapping::callerRegisteredEntitlementsNeedProcessing(
+    const PlistDictionary& entitlements, const std::string& identifier) {
+  const PlistDictionary info{{kKSTEntitlementsKey, entitlements}};
+  return withState(true, [&](KSTCodeSigningMappingState& state) {
+    if (!state._onQueue_identifierHasCallerRegisteredEntitlements(identifier) &&
+        state._onQueue_codeSigningInfoExistForIdentifier(identifier)) {
+      return false;  // information from elsewhere: not the client's to change
+    }
+    return !state._onQueue_callerRegisteredInfoIsCurrent(identifier, info);
+  });
+}
+
 std::uint64_t KSTCodeSigningMapping::processCallerRegisteredEntitlements(
     const PlistDictionary& entitlements, const std::optional<std::string>& forIdentifier) {
   const PlistDictionary info{{kKSTEntitlementsKey, entitlements}};

@@ -28,7 +28,9 @@ bool needsItsOwnEntitlement(const char* entitlement) {
 }
 
 // Refusal: the connection is closed and nothing is sent.
-void cancelPeer(platform::MessageConnection& connection) { connection.cancel(); }
+void cancelPeer(platform::MessageConnection& connection) {
+  connection.cancel();
+}
 
 }  // namespace
 
@@ -102,15 +104,14 @@ std::unique_ptr<KSTClientConnection> checkEntitlementsAndInitClientObject(
   }
 
   // 8.
-  auto client = std::make_unique<KSTClientConnection>(bundleId, connection.effectiveUserId(),
-                                                      allowOtherIdLookup, std::move(wipeIdentifiers));
+  auto client = std::make_unique<KSTClientConnection>(
+      bundleId, connection.effectiveUserId(), allowOtherIdLookup, std::move(wipeIdentifiers));
   // 9. A client that registered its own entitlements before, or that has no
   // information at all, has them processed again; unchanged ones change
   // nothing. Without a signing identifier there is nothing to process for.
   if (bundleId) {
     KSTCodeSigningMapping& mapping = KSTCodeSigningMapping::sharedInstance();
-    if (mapping.identifierHasCallerRegisteredEntitlements(*bundleId) ||
-        !mapping.codeSigningInfoExistForIdentifier(*bundleId)) {
+    if (mapping.callerRegisteredEntitlementsNeedProcessing(entitlements, *bundleId)) {
       const std::uint64_t code =
           mapping.processCallerRegisteredEntitlements(entitlements, bundleId);
       if (code != kKSTSuccess) {
@@ -173,7 +174,8 @@ void KSTProcessVexelEvent(std::shared_ptr<platform::MessageConnection> connectio
   }
 
   // 4.
-  std::unique_ptr<KSTClientConnection> client = checkEntitlementsAndInitClientObject(*connection, row);
+  std::unique_ptr<KSTClientConnection> client =
+      checkEntitlementsAndInitClientObject(*connection, row);
   if (!client) {
     cancelPeer(*connection);
     return;
@@ -211,7 +213,8 @@ bool KSTStartRequestListener(std::shared_ptr<platform::DispatchQueue> queue) {
   std::string errorText;
   // Kept for the life of the process.
   static std::shared_ptr<platform::MessageListener> listener;
-  listener = ipc->createListener(kKSTServiceName, std::move(queue), KSTProcessVexelEvent, &errorText);
+  listener =
+      ipc->createListener(kKSTServiceName, std::move(queue), KSTProcessVexelEvent, &errorText);
   if (!listener) {
     KSTLog(kLogError, "Failed to create listener for %s: %@", kKSTServiceName, errorText);
     return false;
