@@ -336,6 +336,30 @@ TEST(CodeSigningIdentityTest, ChangesToTheRegistryAreSeenByTheNextLookup) {
        gamma, "(none)"},
       {"directory made safe again", [&] { setOwnerAndMode(registry.directory(), 0, 0755); }, gamma,
        "com.example.gamma"},
+      // Changes on the way to the directory, which a watch of the directory
+      // alone would not see.
+      {"directory replaced by another one",
+       [&] {
+         const fs::path parent = fs::path(registry.directory()).parent_path();
+         fs::rename(registry.directory(), parent / "signatures.old");
+         fs::create_directory(registry.directory());
+         setOwnerAndMode(registry.directory(), 0, 0755);
+         registry.writeEntry("gamma.plist", entry("com.example.gamma.new", "Executable",
+                                                  gamma.executablePath.value()));
+       },
+       gamma, "com.example.gamma.new"},
+      {"the directory above it renamed away",
+       [&] {
+         const fs::path kestrel = fs::path(registry.directory()).parent_path();
+         fs::rename(kestrel, kestrel.parent_path() / "kestrel.away");
+       },
+       gamma, "(none)"},
+      {"the directory above it back again",
+       [&] {
+         const fs::path kestrel = fs::path(registry.directory()).parent_path();
+         fs::rename(kestrel.parent_path() / "kestrel.away", kestrel);
+       },
+       gamma, "com.example.gamma.new"},
   };
   for (const Step& step : steps) {
     SCOPED_TRACE(step.name);

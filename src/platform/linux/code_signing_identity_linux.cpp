@@ -150,6 +150,8 @@ struct LinuxCodeSigningIdentity::Registry {
     std::optional<PlistDictionary> entitlements;
   };
 
+  // The number of changes the watch had reported when this was read.
+  std::uint64_t changesSeen = 0;
   // The directory's stamp when it was read; nothing when it was missing.
   std::optional<FileStamp> directoryStamp;
   // Set when the directory itself is not trusted: then nothing is.
@@ -252,7 +254,7 @@ struct LinuxCodeSigningIdentity::Registry {
     byExecutable[*path].push_back(std::move(entry));
   }
 
-  static std::shared_ptr<const Registry> load(const std::string& directory) {
+  static std::shared_ptr<Registry> load(const std::string& directory) {
     auto registry = std::make_shared<Registry>();
     const UniqueFd directoryFd(
         ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC | O_NOFOLLOW));
@@ -301,27 +303,36 @@ struct LinuxCodeSigningIdentity::Registry {
 // ---------------------------------------------------------------------------
 
 LinuxCodeSigningIdentity::LinuxCodeSigningIdentity(FilesystemRoot root)
-    : directory_(root.resolve(kSignaturesDirectory)) {}
+    : directory_(root.resolve(kSignaturesDirectory)), watch_(directory_, root.resolve("/")) {}
 
 LinuxCodeSigningIdentity::~LinuxCodeSigningIdentity() = default;
 
 std::shared_ptr<const LinuxCodeSigningIdentity::Registry>
-LinuxCodeSigningIdentity::currentRegistry() {
-  std::shared_ptr<const Registry> registry;
-  {
-    const std::lock_guard lock(mutex_);
-    registry = registry_;
-  }
-  if (registry && registry->isCurrent(directory_)) return registry;
+LinuxCodeSigningIdentity::usableRegistryLocked() {
+  if (watch_.changed()) ++changes_;
+  if (!registry_) return nullptr;
+  if (watched_) return registry_->changesSeen == changes_ ? registry_ : nullptr;
+  return registry_->isCurrent(directory_) ? registry_ : nullptr;
+}
 
-  const std::lock_guard reload(reloadMutex_);
+std::shared_ptr<const LinuxCodeSigningIdentity::Registry>
+LinuxCodeSigningIdentity::currentRegistry() {
   {
     const std::lock_guard lock(mutex_);
-    registry = registry_;
+    if (auto registry = usableRegistryLocked()) return registry;
   }
-  // Another thread may have read it while this one waited.
-  if (registry && registry->isCurrent(directory_)) return registry;
-  registry = Registry::load(directory_);
+  const std::lock_guard reload(reloadMutex_);
+  std::uint64_t changesSeen = 0;
+  {
+    const std::lock_guard lock(mutex_);
+    // Another thread may have read it while this one waited.
+    if (auto registry = usableRegistryLocked()) return registry;
+    // Watches first: whatever changes from here on is reported.
+    watched_ = watch_.arm();
+    changesSeen = changes_;
+  }
+  std::shared_ptr<Registry> registry = Registry::load(directory_);
+  registry->changesSeen = changesSeen;
   const std::lock_guard lock(mutex_);
   registry_ = registry;
   return registry;

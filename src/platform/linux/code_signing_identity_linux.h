@@ -19,17 +19,21 @@
 // executable must be a regular file owned by root and not writable by group or
 // others. docs/security.md describes what this identity can and cannot tell.
 //
-// The registry is cached and read again whenever the directory or one of its
-// files changes (inode, owner, mode, size, modification or change time), which
-// is checked with a few stat calls on every identify(). identify() may be
+// The registry is cached and read again whenever the directory, one of its
+// files or a directory on the way to it changes, which an inotify watch tells
+// with one non-blocking read per identify(). Where the watch cannot be placed,
+// every identify() compares the directory and its files with what was read
+// (inode, owner, mode, size, modification and change time). identify() may be
 // called from any number of threads at once.
 #pragma once
 
+#include <cstdint>
 #include <memory>
 #include <mutex>
 #include <string>
 
 #include "platform/code_signing_identity.h"
+#include "platform/linux/directory_watch_linux.h"
 #include "platform/root.h"
 
 namespace kestrel::platform {
@@ -55,11 +59,17 @@ class LinuxCodeSigningIdentity final : public CodeSigningIdentity {
   // The registry as it is on disk now, read again if it changed.
   std::shared_ptr<const Registry> currentRegistry();
 
+  // The registry to use now, or nullptr when it must be read again. Under mutex_.
+  std::shared_ptr<const Registry> usableRegistryLocked();
+
   const std::string directory_;
   // Lock order: reloadMutex_, then mutex_.
   std::mutex reloadMutex_;  // one reload at a time
-  std::mutex mutex_;        // guards registry_
+  std::mutex mutex_;        // guards what follows
   std::shared_ptr<const Registry> registry_;
+  DirectoryChangeWatch watch_;
+  bool watched_ = false;       // the watch covers the registry as read
+  std::uint64_t changes_ = 0;  // changes the watch reported
 };
 
 }  // namespace kestrel::platform
