@@ -9,6 +9,7 @@
 //             owners and final rename in-process, without the daemon.
 //
 //   kestrel_request_bench --address unix:path=... --root R --out DIR [--seconds S]
+//                         [--only ping|lookup|reject]
 //
 // Writes DIR/request_bench.json (figures and ratios) and DIR/latencies.csv
 // (phase, clients, microseconds; one line a request) for plotting. The
@@ -191,9 +192,54 @@ Phase timedLoop(const std::string& name, std::size_t count,
   return phase;
 }
 
+void printTable(const std::vector<Phase>& phases) {
+  std::printf("%-16s %7s %9s %10s %10s %10s %12s\n", "phase", "clients", "requests", "p50 us",
+              "p90 us", "p99 us", "per second");
+  for (const Phase& p : phases) {
+    std::printf("%-16s %7d %9zu %10.1f %10.1f %10.1f %12.0f\n", p.name.c_str(), p.clients,
+                p.micros.size(), p.percentile(0.5), p.percentile(0.9), p.percentile(0.99),
+                p.throughput());
+  }
+}
+
+void lookupOne(Connection& c, std::mt19937_64& random) {
+  const std::size_t i = random() % kPopulation;
+  if (c.request(containerRequest(identifierFor("com.example.bench.", i), false)) != 1) {
+    throw std::runtime_error("lookup failed");
+  }
+}
+
+// `--only ping|lookup|reject`: that phase with 1, 2 and 8 clients, to profile the
+// daemon while it runs.
+int runOnly(const std::string& only, const std::string& address, double seconds) {
+  std::vector<Phase> phases;
+  for (int clients : {1, 2, 8}) {
+    if (only == "ping") {
+      phases.push_back(runTimed("ping", address, clients, seconds,
+                                [](Connection& c, std::mt19937_64&) { c.ping(); }));
+    } else if (only == "lookup") {
+      phases.push_back(runTimed("lookup", address, clients, seconds, lookupOne));
+    } else if (only == "reject") {
+      // A lookup's request naming no valid class: the transport, admission
+      // and the request's decoding, without the lookup itself.
+      phases.push_back(runTimed("reject", address, clients, seconds, [](Connection& c, auto&) {
+        MessageDictionary request = containerRequest(identifierFor("com.example.bench.", 0), false);
+        request.setUint64("ContainerClass", 999);
+        if (c.request(request) == 1) throw std::runtime_error("class 999 was accepted");
+      }));
+    } else {
+      std::cerr << "--only takes ping, lookup or reject\n";
+      return 2;
+    }
+  }
+  printTable(phases);
+  return 0;
+}
+
 int run(int argc, char** argv) {
   std::string address, root, out;
   double seconds = 3;
+  std::string only;  // one phase alone, for profiling: no ratios, no files
   for (int i = 1; i + 1 < argc; i += 2) {
     const std::string option = argv[i];
     if (option == "--address")
@@ -204,9 +250,12 @@ int run(int argc, char** argv) {
       out = argv[i + 1];
     else if (option == "--seconds")
       seconds = std::stod(argv[i + 1]);
+    else if (option == "--only")
+      only = argv[i + 1];
   }
   if (address.empty() || root.empty() || out.empty()) {
-    std::cerr << "usage: kestrel_request_bench --address A --root R --out DIR [--seconds S]\n";
+    std::cerr << "usage: kestrel_request_bench --address A --root R --out DIR [--seconds S] "
+                 "[--only ping|lookup|reject]\n";
     return 2;
   }
 
@@ -222,16 +271,11 @@ int run(int argc, char** argv) {
   }
 
   std::vector<Phase> phases;
+  if (!only.empty()) return runOnly(only, address, seconds);
   for (int clients : {1, 2, 8}) {
     phases.push_back(runTimed("ping", address, clients, seconds,
                               [](Connection& c, std::mt19937_64&) { c.ping(); }));
-    phases.push_back(
-        runTimed("lookup", address, clients, seconds, [](Connection& c, std::mt19937_64& random) {
-          const std::size_t i = random() % kPopulation;
-          if (c.request(containerRequest(identifierFor("com.example.bench.", i), false)) != 1) {
-            throw std::runtime_error("lookup failed");
-          }
-        }));
+    phases.push_back(runTimed("lookup", address, clients, seconds, lookupOne));
   }
   {
     Connection connection(address);
@@ -284,13 +328,7 @@ int run(int argc, char** argv) {
                        {"lookup_throughput_2_clients_over_1", 1.6}};
   std::ofstream(out + "/request_bench.json") << result.dump(2) << "\n";
 
-  std::printf("%-16s %7s %9s %10s %10s %10s %12s\n", "phase", "clients", "requests", "p50 us",
-              "p90 us", "p99 us", "per second");
-  for (const Phase& p : phases) {
-    std::printf("%-16s %7d %9zu %10.1f %10.1f %10.1f %12.0f\n", p.name.c_str(), p.clients,
-                p.micros.size(), p.percentile(0.5), p.percentile(0.9), p.percentile(0.99),
-                p.throughput());
-  }
+  printTable(phases);
   std::printf("\nRatios (target in brackets):\n");
   for (auto& [key, value] : ratios.items()) {
     std::printf("  %-42s %6.2fx\n", key.c_str(), value.get<double>());
