@@ -18,9 +18,12 @@ struct PeerCredentials {
   pid_t pid = 0;
   uid_t uid = 0;  // effective user id
   gid_t gid = 0;
-  std::shared_ptr<UniqueFd> pidfd;             // absent when pidfd_open failed
-  std::optional<std::string> securityLabel;    // SO_PEERSEC, when an LSM recorded one
-  std::optional<std::string> executablePath;   // /proc/<pid>/exe at accept, when readable
+  std::shared_ptr<UniqueFd> pidfd;            // absent when pidfd_open failed
+  std::optional<std::string> securityLabel;   // SO_PEERSEC, when an LSM recorded one
+  std::optional<std::string> executablePath;  // /proc/<pid>/exe at accept, when readable
+  // That file itself (O_PATH), so that it can be examined without a path walk
+  // and is the binary the peer ran when it connected.
+  std::shared_ptr<UniqueFd> executable;
 };
 
 // Reads the credentials of the peer of a connected Unix socket.

@@ -1,3 +1,4 @@
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <plist/plist.h>
 #include <sys/stat.h>
@@ -409,6 +410,28 @@ TEST(CodeSigningIdentityTest, DamagedRegistryFileIsRefusedNotFollowed) {
   const CodeSigningIdentityResult alpha = LinuxCodeSigningIdentity(registry.scratch.root())
                                               .identify(registry.peer(registry.client("alpha")));
   EXPECT_EQ(alpha.signingIdentifier, "com.example.alpha");
+}
+
+// The binary a peer ran when it connected is what must be trusted, not what
+// lies at its path by the time it asks: a writable binary swapped for a safe
+// one after connecting does not pass.
+TEST(CodeSigningIdentityTest, TheBinaryOpenedAtConnectIsTheOneExamined) {
+  Registry registry;
+  const std::string path = registry.client("alpha");
+  setOwnerAndMode(path, 1000, 0755);
+  PeerCredentials peer = registry.peer(path);
+  peer.executable = std::make_shared<UniqueFd>(::open(path.c_str(), O_PATH | O_CLOEXEC));
+  ASSERT_TRUE(*peer.executable);
+  fs::copy_file("/bin/true", path + ".safe");
+  setOwnerAndMode(path + ".safe", 0, 0755);
+  fs::rename(path + ".safe", path);
+
+  LinuxCodeSigningIdentity identity(registry.scratch.root());
+  const CodeSigningIdentityResult result = identity.identify(peer);
+  EXPECT_FALSE(result.signingIdentifier);
+  EXPECT_NE(result.error.find("is not owned by root"), std::string::npos) << result.error;
+  peer.executable.reset();  // without the opened file, the path decides
+  EXPECT_EQ(identity.identify(peer).signingIdentifier, "com.example.alpha");
 }
 
 }  // namespace

@@ -37,7 +37,8 @@ using namespace std::chrono_literals;
 constexpr const char* kService = "com.zorvane.kestreld";
 constexpr const char* kObject = "/com/zorvane/kestreld";
 // Only a guard against a hang: every wait normally ends long before it.
-constexpr auto kTimeout = 30s;  // generous: only a failing test waits this long, and CI runs under ASan
+constexpr auto kTimeout =
+    30s;  // generous: only a failing test waits this long, and CI runs under ASan
 constexpr std::uint64_t kCallTimeoutUsec = 5'000'000;
 
 struct BusUnref {
@@ -432,6 +433,7 @@ TEST_F(DBusListenerTest, PeerCredentialsAreThoseOfTheClientProcess) {
   EXPECT_EQ(seen->uid, ::geteuid());
   EXPECT_EQ(seen->gid, ::getegid());
   EXPECT_NE(seen->pidfd, nullptr);
+  EXPECT_NE(seen->executable, nullptr);
   ASSERT_TRUE(seen->executablePath);
   EXPECT_EQ(std::filesystem::path(*seen->executablePath).filename(), "busctl");
 }

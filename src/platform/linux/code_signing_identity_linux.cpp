@@ -378,9 +378,12 @@ CodeSigningIdentityResult LinuxCodeSigningIdentity::identify(const PeerCredentia
   const Registry::Entry& entry = found->second.front();
 
   if (!byLabel) {
-    // Only a binary that no one but root can change stands for the identity.
+    // Only a binary that no one but root can change stands for the identity:
+    // the one the peer ran when it connected, or the file at its path when
+    // that was not opened.
     struct stat st {};
-    if (::lstat(key.c_str(), &st) != 0) {
+    const bool opened = peer.executable && *peer.executable;
+    if ((opened ? ::fstat(peer.executable->get(), &st) : ::lstat(key.c_str(), &st)) != 0) {
       result.error = "executable " + key + " cannot be examined: " + errorText(errno);
       return result;
     }

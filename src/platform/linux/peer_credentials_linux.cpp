@@ -4,9 +4,10 @@
 // pins that process: SO_PEERPIDFD hands us one for exactly the peer (Linux
 // 6.5 and later); on older kernels pidfd_open(pid) is the fallback, which
 // cannot rule out a pid reused between connect and accept. The executable is
-// read from /proc/<pid>/exe and kept only if the pidfd's process is still
+// opened through /proc/<pid>/exe and kept, with its path, only if the pidfd's process is still
 // alive afterwards, so the path cannot belong to a process that took over the
 // pid in the meantime.
+#include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
@@ -59,8 +60,15 @@ std::optional<std::string> securityLabel(int socketFd) {
   return std::nullopt;
 }
 
-std::optional<std::string> executablePath(pid_t pid) {
+// The file the process runs, opened (O_PATH) through /proc/<pid>/exe.
+UniqueFd openExecutable(pid_t pid) {
   const std::string link = "/proc/" + std::to_string(pid) + "/exe";
+  return UniqueFd(::open(link.c_str(), O_PATH | O_CLOEXEC));
+}
+
+// The path of an open file, as the kernel names it.
+std::optional<std::string> pathOf(int fd) {
+  const std::string link = "/proc/self/fd/" + std::to_string(fd);
   std::vector<char> buffer(4096);
   const ssize_t length = ::readlink(link.c_str(), buffer.data(), buffer.size());
   if (length <= 0 || static_cast<std::size_t>(length) >= buffer.size()) return std::nullopt;
@@ -86,8 +94,14 @@ PeerCredentials readPeerCredentials(int socketFd) {
 
   UniqueFd pidfd = peerPidfd(socketFd, cred.pid);
   if (cred.pid > 0) {
-    auto path = executablePath(cred.pid);
-    if (path && pidfd && pidfdAlive(pidfd.get())) peer.executablePath = std::move(path);
+    // The path is read from the opened file, so the two name the same file
+    // even if the process executes another program meanwhile.
+    UniqueFd executable = openExecutable(cred.pid);
+    auto path = executable ? pathOf(executable.get()) : std::nullopt;
+    if (path && pidfd && pidfdAlive(pidfd.get())) {
+      peer.executablePath = std::move(path);
+      peer.executable = std::make_shared<UniqueFd>(std::move(executable));
+    }
   }
   if (pidfd) peer.pidfd = std::make_shared<UniqueFd>(std::move(pidfd));
   return peer;
