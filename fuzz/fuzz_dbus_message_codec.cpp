@@ -249,7 +249,8 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
 
   platform::MessageDictionary dictionary;
   if (platform::dbus::readDictionary(message.get(), &dictionary) < 0) return 0;
-  (void)dictionary.description();
+  // Rendering costs as much as reading; one input in four is enough for it.
+  if (sampled({data, size}, 4)) (void)dictionary.description();
 
   // What was read travels again unchanged.
   const UniqueMessage copy = newMessage();

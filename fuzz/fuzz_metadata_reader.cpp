@@ -7,6 +7,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <optional>
+#include <set>
 #include <span>
 #include <string>
 
@@ -76,7 +77,9 @@ KSTMetadataRef read(const KSTFileURL& url, std::uint32_t forUser, bool checkClas
 // It lies in its class's own directory, so the class path check passes too.
 void checkWriteBack(const KSTMetadata& record) {
   const KSTFileURL copyURL = containerURL(record.containerClass(), "WrittenBack");
-  makeDirectoriesOrDie(copyURL.path());
+  // Made once per class, not for every record.
+  static std::set<KSTContainerClass> made;
+  if (made.insert(record.containerClass()).second) makeDirectoriesOrDie(copyURL.path());
   const KSTMetadataRef copy =
       KSTMetadata::initWithUserId(record.uid(), record.uuid(), record.containerClass(),
                                   record.identifier(), record.info(), copyURL);

@@ -25,7 +25,11 @@ const std::string& registryFile() {
     // Trusted only when root owns it and no one else may write.
     ::chmod(environment().resolve("/etc/kestrel").c_str(), 0755);
     ::chmod(directory.c_str(), 0755);
-    return directory + "/fuzzed.plist";
+    // Made once with the mode the registry trusts; rewriting it keeps the mode.
+    const std::string file = directory + "/fuzzed.plist";
+    writeFileOrDie(file, {});
+    ::chmod(file.c_str(), 0644);
+    return file;
   }();
   return path;
 }
@@ -44,7 +48,6 @@ bool hasNul(const std::string& s) {
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   const std::span<const std::uint8_t> bytes(data, size);
   writeFileOrDie(registryFile(), bytes);
-  ::chmod(registryFile().c_str(), 0644);
 
   platform::LinuxCodeSigningIdentity registry(environment());
   const auto parsed = platform::parsePropertyList(bytes, nullptr);

@@ -1,13 +1,15 @@
 #include "support/fuzz_environment.h"
 
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <cmath>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <filesystem>
-#include <fstream>
 #include <memory>
 #include <system_error>
 
@@ -19,6 +21,7 @@
 #include "platform/fake/fake_upcall_channel.h"
 #include "platform/logging.h"
 #include "platform/services.h"
+#include "platform/unique_fd.h"
 
 namespace kestrel::fuzz {
 
@@ -111,12 +114,28 @@ void makeDirectoriesOrDie(const std::string& path) {
 }
 
 void writeFileOrDie(const std::string& path, std::span<const std::uint8_t> bytes) {
-  makeDirectoriesOrDie(fs::path(path).parent_path().string());
-  std::ofstream out(path, std::ios::binary | std::ios::trunc);
-  out.write(reinterpret_cast<const char*>(bytes.data()),
-            static_cast<std::streamsize>(bytes.size()));
-  out.close();
-  if (!out) fail("cannot write a file", path);
+  // Called for every input: one open, write and close when the directory is
+  // already there (tmpfs, no sync), the directories only on the first call.
+  constexpr int kFlags = O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC;
+  platform::UniqueFd fd(::open(path.c_str(), kFlags, 0644));
+  if (!fd && errno == ENOENT) {
+    makeDirectoriesOrDie(fs::path(path).parent_path().string());
+    fd.reset(::open(path.c_str(), kFlags, 0644));
+  }
+  if (!fd) fail("cannot open a file for writing", path + ": " + std::strerror(errno));
+  std::size_t written = 0;
+  while (written < bytes.size()) {
+    const ssize_t n = ::write(fd.get(), bytes.data() + written, bytes.size() - written);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) fail("cannot write a file", path + ": " + std::strerror(errno));
+    written += static_cast<std::size_t>(n);
+  }
+}
+
+bool sampled(std::span<const std::uint8_t> input, unsigned oneIn) {
+  std::uint64_t hash = 0xcbf29ce484222325ull;  // FNV-1a
+  for (const std::uint8_t byte : input) hash = (hash ^ byte) * 0x100000001b3ull;
+  return oneIn <= 1 || hash % oneIn == 0;
 }
 
 void fail(const char* what, const std::string& detail) {

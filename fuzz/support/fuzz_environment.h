@@ -26,6 +26,12 @@ const platform::FilesystemRoot& environment();
 void writeFileOrDie(const std::string& path, std::span<const std::uint8_t> bytes);
 void makeDirectoriesOrDie(const std::string& path);
 
+// Whether this input is one of the one-in-n that also run a costly check whose
+// code does not depend on the input's shape (rendering a description, say).
+// Decided by a hash of the bytes, so an input always makes the same choice and
+// a reproducer runs the check it failed.
+bool sampled(std::span<const std::uint8_t> input, unsigned oneIn);
+
 // Prints what went wrong and aborts, so that libFuzzer keeps the input.
 [[noreturn]] void fail(const char* what, const std::string& detail = {});
 #define KESTREL_FUZZ_CHECK(condition, detail)                                     \
