@@ -4,9 +4,9 @@
 // pins that process: SO_PEERPIDFD hands us one for exactly the peer (Linux
 // 6.5 and later); on older kernels pidfd_open(pid) is the fallback, which
 // cannot rule out a pid reused between connect and accept. The executable is
-// opened through /proc/<pid>/exe and kept, with its path, only if the pidfd's process is still
-// alive afterwards, so the path cannot belong to a process that took over the
-// pid in the meantime.
+// opened through /proc/<pid>/exe and kept, with its path, only if the pidfd's
+// process is still alive afterwards, so neither can belong to a process that
+// took over the pid in the meantime.
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
