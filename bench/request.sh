@@ -37,7 +37,7 @@ PLIST
 socket="$root/run/kestrel/com.zorvane.kestreld"
 KESTREL_ROOT="$root" "$build_dir/kestreld" 2>/dev/null &
 pid=$!
-trap 'kill -TERM $pid 2>/dev/null || true; wait $pid 2>/dev/null || true; rm -rf "$root"' EXIT
+trap 'kill -TERM $pid 2>/dev/null || true; wait $pid 2>/dev/null || true; "$source_dir/tools/remove-scratch-root.sh" "$root"' EXIT
 for _ in $(seq 200); do [[ -S "$socket" ]] && break; sleep 0.05; done
 
 out="$here/results/request-$(date -u +%Y%m%dT%H%M%SZ)"

@@ -41,6 +41,7 @@ kestreld is up (pid $pid)
   request socket: $socket
   upcall socket:  $upcall
   stop it with:   Ctrl-C, or kill -TERM $pid
+  afterwards:     tools/remove-scratch-root.sh $root
 INFO
 k() {
   echo "\$ kestrelctl $*"
