@@ -4,6 +4,7 @@
 // and the executable read through the pidfd right at accept.
 #pragma once
 
+#include <sys/stat.h>
 #include <sys/types.h>
 
 #include <memory>
@@ -21,9 +22,11 @@ struct PeerCredentials {
   std::shared_ptr<UniqueFd> pidfd;            // absent when pidfd_open failed
   std::optional<std::string> securityLabel;   // SO_PEERSEC, when an LSM recorded one
   std::optional<std::string> executablePath;  // /proc/<pid>/exe at accept, when readable
-  // That file itself (O_PATH), so that it can be examined without a path walk
-  // and is the binary the peer ran when it connected.
-  std::shared_ptr<UniqueFd> executable;
+  // That file's owner and mode when the peer connected, read from the file the
+  // peer ran (not from whatever lies at its path later). Only root can change
+  // the owner or mode of a root-owned file, so what was trusted at connect
+  // stays trusted for the life of the connection without a look per request.
+  std::optional<struct stat> executableStatus;
 };
 
 // Reads the credentials of the peer of a connected Unix socket.

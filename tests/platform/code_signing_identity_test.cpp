@@ -412,16 +412,17 @@ TEST(CodeSigningIdentityTest, DamagedRegistryFileIsRefusedNotFollowed) {
   EXPECT_EQ(alpha.signingIdentifier, "com.example.alpha");
 }
 
-// The binary a peer ran when it connected is what must be trusted, not what
-// lies at its path by the time it asks: a writable binary swapped for a safe
-// one after connecting does not pass.
+// The binary a peer ran, as it was when it connected, is what must be
+// trusted, not what lies at its path by the time it asks: a writable binary
+// swapped for a safe one after connecting does not pass.
 TEST(CodeSigningIdentityTest, TheBinaryOpenedAtConnectIsTheOneExamined) {
   Registry registry;
   const std::string path = registry.client("alpha");
   setOwnerAndMode(path, 1000, 0755);
   PeerCredentials peer = registry.peer(path);
-  peer.executable = std::make_shared<UniqueFd>(::open(path.c_str(), O_PATH | O_CLOEXEC));
-  ASSERT_TRUE(*peer.executable);
+  struct stat atConnect {};
+  ASSERT_EQ(::stat(path.c_str(), &atConnect), 0);
+  peer.executableStatus = atConnect;
   fs::copy_file("/bin/true", path + ".safe");
   setOwnerAndMode(path + ".safe", 0, 0755);
   fs::rename(path + ".safe", path);
@@ -430,7 +431,7 @@ TEST(CodeSigningIdentityTest, TheBinaryOpenedAtConnectIsTheOneExamined) {
   const CodeSigningIdentityResult result = identity.identify(peer);
   EXPECT_FALSE(result.signingIdentifier);
   EXPECT_NE(result.error.find("is not owned by root"), std::string::npos) << result.error;
-  peer.executable.reset();  // without the opened file, the path decides
+  peer.executableStatus.reset();  // without what was read at connect, the path decides
   EXPECT_EQ(identity.identify(peer).signingIdentifier, "com.example.alpha");
 }
 

@@ -379,11 +379,12 @@ CodeSigningIdentityResult LinuxCodeSigningIdentity::identify(const PeerCredentia
 
   if (!byLabel) {
     // Only a binary that no one but root can change stands for the identity:
-    // the one the peer ran when it connected, or the file at its path when
-    // that was not opened.
+    // the one the peer ran, as it was when it connected, or the file at its
+    // path when that could not be examined then.
     struct stat st {};
-    const bool opened = peer.executable && *peer.executable;
-    if ((opened ? ::fstat(peer.executable->get(), &st) : ::lstat(key.c_str(), &st)) != 0) {
+    if (peer.executableStatus) {
+      st = *peer.executableStatus;
+    } else if (::lstat(key.c_str(), &st) != 0) {
       result.error = "executable " + key + " cannot be examined: " + errorText(errno);
       return result;
     }

@@ -4,12 +4,14 @@
 // pins that process: SO_PEERPIDFD hands us one for exactly the peer (Linux
 // 6.5 and later); on older kernels pidfd_open(pid) is the fallback, which
 // cannot rule out a pid reused between connect and accept. The executable is
-// opened through /proc/<pid>/exe and kept, with its path, only if the pidfd's
-// process is still alive afterwards, so neither can belong to a process that
-// took over the pid in the meantime.
+// opened through /proc/<pid>/exe; its path and its owner and mode (read
+// from the opened file) are kept only if the pidfd's process is still alive
+// afterwards, so none of them can belong to a process that took over the pid
+// in the meantime.
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/socket.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -98,9 +100,10 @@ PeerCredentials readPeerCredentials(int socketFd) {
     // even if the process executes another program meanwhile.
     UniqueFd executable = openExecutable(cred.pid);
     auto path = executable ? pathOf(executable.get()) : std::nullopt;
-    if (path && pidfd && pidfdAlive(pidfd.get())) {
+    struct stat status {};
+    if (path && ::fstat(executable.get(), &status) == 0 && pidfd && pidfdAlive(pidfd.get())) {
       peer.executablePath = std::move(path);
-      peer.executable = std::make_shared<UniqueFd>(std::move(executable));
+      peer.executableStatus = status;
     }
   }
   if (pidfd) peer.pidfd = std::make_shared<UniqueFd>(std::move(pidfd));
