@@ -61,6 +61,15 @@ auto runCatchingExceptions(const char* function, int line, KSTErrorRef* error, F
 #define KST_CACHE_OPERATION(error, fallback, body) \
   runCatchingExceptions(function, __LINE__, (error), (fallback), (body))
 
+// "<user>-<class path>", the name of one class map (and how it is logged);
+// built on every lookup, so without the formatter.
+std::string classMapKey(std::uint32_t user, KSTContainerClass contentClass) {
+  std::string key = std::to_string(user);
+  key += '-';
+  key += KSTContainerClassPath(contentClass);
+  return key;
+}
+
 }  // namespace
 
 KSTContainerCache& KSTContainerCache::sharedInstance() {
@@ -80,7 +89,7 @@ KSTContainerCache::ClassMap* KSTContainerCache::_getCacheForUserId(std::uint32_t
     return nullptr;
   }
   auto& caches = transient ? transientContainerCache_ : liveContainerCache_;
-  std::string key = formatMessage("%u-%@", userId, KSTContainerClassPath(contentClass));
+  std::string key = classMapKey(userId, contentClass);
   if (auto it = caches.find(key); it != caches.end()) return &it->second;
 
   KSTLog(kLogDebug, "Rebuilding container class cache: %@%@", key, suffixFor(transient));
@@ -335,7 +344,7 @@ void KSTContainerCache::_discardClassMapForUser(std::uint32_t user, KSTContainer
                                                 bool transient) {
   std::lock_guard guard(cacheLock_);
   auto& caches = transient ? transientContainerCache_ : liveContainerCache_;
-  caches.erase(formatMessage("%u-%@", user, KSTContainerClassPath(contentClass)));
+  caches.erase(classMapKey(user, contentClass));
 }
 
 }  // namespace kestrel

@@ -223,7 +223,7 @@ bool PeerSession::wait() {
 }
 
 void PeerSession::drainInbox() {
-  std::deque<PeerCommand> commands = inbox_->take();
+  std::vector<PeerCommand> commands = inbox_->take();
   if (commands.empty()) return;
   for (PeerCommand& command : commands) execute(command);
   if (tooManyUnreadReplies()) closeRequested_ = true;  // it sends but does not read
@@ -341,8 +341,8 @@ void PeerInbox::post(PeerCommand command) {
   [[maybe_unused]] ssize_t written = ::write(wakeFd_.get(), &one, sizeof one);
 }
 
-std::deque<PeerCommand> PeerInbox::take() {
-  std::deque<PeerCommand> commands;
+std::vector<PeerCommand> PeerInbox::take() {
+  std::vector<PeerCommand> commands;
   std::lock_guard lock(mutex_);
   if (commands_.empty()) return commands;
   std::uint64_t value = 0;

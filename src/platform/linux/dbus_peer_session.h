@@ -11,7 +11,7 @@
 #include <systemd/sd-id128.h>
 
 #include <cstdint>
-#include <deque>
+#include <vector>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -49,14 +49,14 @@ class PeerInbox {
   // Dropped once the connection is closed.
   void post(PeerCommand command);
   // Everything posted so far; clears the wake-up.
-  std::deque<PeerCommand> take();
+  std::vector<PeerCommand> take();
   // Later posts are dropped.
   void close();
 
  private:
   UniqueFd wakeFd_;
   std::mutex mutex_;
-  std::deque<PeerCommand> commands_;
+  std::vector<PeerCommand> commands_;
   bool closed_ = false;
 };
 
