@@ -11,10 +11,10 @@
 #include <systemd/sd-id128.h>
 
 #include <cstdint>
-#include <vector>
 #include <memory>
 #include <mutex>
 #include <string>
+#include <vector>
 
 #include "platform/message_ipc.h"
 #include "platform/unique_fd.h"
