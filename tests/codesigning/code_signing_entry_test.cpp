@@ -80,33 +80,11 @@ TEST(CodeSigningEntryTest, EqualityComparesEveryField) {
   EXPECT_EQ(base, KSTCodeSigningEntry(sampleInfo(), 2));
 }
 
-TEST(CodeSigningEntryTest, HashAddsTheFlagWeights) {
-  KSTCodeSigningEntry entry;
-  entry.setInvalid(true);
-  entry.setDataContainerClass(2);
-  EXPECT_EQ(entry.hash(), 18u);
-  entry.setPlaceholder(true);
-  entry.setRegisteredByCaller(true);
-  EXPECT_EQ(entry.hash(), 30u);
-  // Equal information hashes equal, whatever the integers' signedness.
+TEST(CodeSigningEntryTest, EqualInformationHashesEqualWhateverTheIntegersSignedness) {
   const KSTCodeSigningEntry signedInfo(PlistDictionary{{"n", std::int64_t{5}}}, 0);
   const KSTCodeSigningEntry unsignedInfo(PlistDictionary{{"n", std::uint64_t{5}}}, 0);
   EXPECT_EQ(signedInfo, unsignedInfo);
   EXPECT_EQ(signedInfo.hash(), unsignedInfo.hash());
-}
-
-TEST(CodeSigningEntryTest, DescriptionShowsFlagsClassChildrenAndInfo) {
-  KSTCodeSigningEntry entry(PlistDictionary{{"k", "v"}}, 2);
-  entry.setPlaceholder(true);
-  const std::string text = entry.description();
-  EXPECT_EQ(
-      text.rfind("<KSTCodeSigningEntry invalid: N, placeholder: Y, regByCaller: N, dataClass: 2, "
-                 "childBundles: (null), CSinfo: ",
-                 0),
-      0u)
-      << text;
-  EXPECT_NE(text.find(PlistValue(PlistDictionary{{"k", "v"}}).description()), std::string::npos);
-  EXPECT_EQ(text.back(), '>');
 }
 
 }  // namespace

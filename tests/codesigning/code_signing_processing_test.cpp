@@ -104,10 +104,8 @@ TEST_F(CodeSigningProcessingTest, SameInformationTwiceWritesNothingTheSecondTime
   ASSERT_EQ(writes(), 1u);
   const auto stored = entry("com.example.app");
   ASSERT_TRUE(stored);
-  EXPECT_EQ(stored->codeSigningInfo(), info);
   EXPECT_EQ(stored->dataContainerClass(), 2u);
   EXPECT_TRUE(stored->placeholder());
-  EXPECT_FALSE(stored->registeredByCaller());
 
   EXPECT_EQ(process(info, "com.example.app", options), kKSTSuccess);
   EXPECT_EQ(writes(), 1u);
@@ -115,8 +113,6 @@ TEST_F(CodeSigningProcessingTest, SameInformationTwiceWritesNothingTheSecondTime
   EXPECT_EQ(process(info, "com.example.app", PlistDictionary{{kKSTRegisteredByCallerOption, true}}),
             kKSTSuccess);
   EXPECT_EQ(writes(), 2u);
-  EXPECT_TRUE(KSTCodeSigningMapping::sharedInstance().identifierHasCallerRegisteredEntitlements(
-      "com.example.app"));
 }
 
 TEST_F(CodeSigningProcessingTest, LosingTheSystemContainerEntitlementStagesTheContainer) {
@@ -193,32 +189,12 @@ TEST_F(CodeSigningProcessingTest, DroppingTheLastReferenceRemovesTheGroupContain
   EXPECT_FALSE(entry("com.example.two"));
 }
 
-TEST_F(CodeSigningProcessingTest, EmptySystemGroupsFallBackToTheContainersKey) {
-  ASSERT_EQ(process(infoWith({{kKSTSystemGroupsEntitlement, "systemgroup.a"}}), "com.example.d"),
-            kKSTSuccess);
-  make(499, kKSTContainerClassSharedSystemGroup, "systemgroup.a");
-
-  EXPECT_EQ(process(infoWith({{kKSTSystemGroupsEntitlement, PlistArray{}},
-                              {kKSTSystemGroupContainersEntitlement, "systemgroup.a"}}),
-                    "com.example.d"),
-            kKSTSuccess);
-  EXPECT_TRUE(exists(499, kKSTContainerClassSharedSystemGroup, "systemgroup.a"));
-
-  EXPECT_EQ(process(infoWith({{kKSTSystemGroupsEntitlement, PlistArray{}}}), "com.example.d"),
-            kKSTSuccess);
-  EXPECT_FALSE(exists(499, kKSTContainerClassSharedSystemGroup, "systemgroup.a"));
-}
-
 TEST_F(CodeSigningProcessingTest, PlugInsJoinAParentThatHasAnEntryOnce) {
   ASSERT_EQ(process(infoWith({}), "com.example.app"), kKSTSuccess);
   const PlistDictionary child{{kKSTParentBundleIDOption, "com.example.app"}};
   for (int run = 0; run < 2; ++run) {
-    SCOPED_TRACE(run);
     EXPECT_EQ(process(infoWith({}), "com.example.app.ext", child), kKSTSuccess);
-    const auto parent = entry("com.example.app");
-    ASSERT_TRUE(parent);
-    EXPECT_EQ(parent->childBundleIdentifiers(), Strings{"com.example.app.ext"});
-    EXPECT_EQ(parent->codeSigningInfo(), infoWith({}));
+    EXPECT_EQ(entry("com.example.app")->childBundleIdentifiers(), Strings{"com.example.app.ext"});
   }
   EXPECT_EQ(writes(), 2u);  // the parent's and the plug-in's entries, once
 

@@ -16,9 +16,9 @@ class ErrorsTest : public ::testing::Test {
 
 TEST_F(ErrorsTest, ErrorCarriesMessageFunctionAndLineAndLogsIt) {
   KSTErrorRef underlying = KST_POSIX_ERROR(ENOENT, "open failed");
-  KSTErrorRef error = KSTCreateError("makeThing", 77, kKSTErrorDomain, kKSTErrorNotFound,
-                                     underlying, nullptr, true, "No Container with userId: %u",
-                                     501u);
+  KSTErrorRef error =
+      KSTCreateError("makeThing", 77, kKSTErrorDomain, kKSTErrorNotFound, underlying, nullptr, true,
+                     "No Container with userId: %u", 501u);
   EXPECT_EQ(error->domain(), kKSTErrorDomain);
   EXPECT_EQ(error->code(), 21);
   EXPECT_EQ(error->localizedDescription(), "No Container with userId: 501");
@@ -28,7 +28,8 @@ TEST_F(ErrorsTest, ErrorCarriesMessageFunctionAndLineAndLogsIt) {
   EXPECT_TRUE(fakes.logging->contains(
       "makeThing", "77: No Container with userId: 501 (" + underlying->description() + ")"));
 
-  KST_ERROR(kKSTErrorInvalidObject, nullptr, true, "Can't act on an invalid object: userId: %u", 3u);
+  KST_ERROR(kKSTErrorInvalidObject, nullptr, true, "Can't act on an invalid object: userId: %u",
+            3u);
   const auto lines = fakes.logging->lines();
   ASSERT_FALSE(lines.empty());
   EXPECT_EQ(lines.back().level, kLogError);
@@ -37,7 +38,8 @@ TEST_F(ErrorsTest, ErrorCarriesMessageFunctionAndLineAndLogsIt) {
 }
 
 TEST_F(ErrorsTest, SilentAndFormatlessErrorsLogNothingButKeepTheirOrigin) {
-  KSTErrorRef silent = KST_ERROR(kKSTErrorNotFound, nullptr, false, "Container with identifier: \"%@\" Not Found", "x");
+  KSTErrorRef silent = KST_ERROR(kKSTErrorNotFound, nullptr, false,
+                                 "Container with identifier: \"%@\" Not Found", "x");
   KSTErrorRef bare = KSTCreateError("f", 5, kKSTErrorDomain, kKSTErrorException,
                                     KST_POSIX_ERROR(EIO, "io"), nullptr, true, nullptr);
   EXPECT_TRUE(fakes.logging->lines().empty());
@@ -47,22 +49,16 @@ TEST_F(ErrorsTest, SilentAndFormatlessErrorsLogNothingButKeepTheirOrigin) {
   EXPECT_EQ(bare->userInfo().at(kKSTSourceFileLineKey).signedInteger(), 5);
 }
 
-TEST_F(ErrorsTest, GivenUserInfoIsKeptAndExtended) {
-  PlistDictionary info{{"Path", "/private/var/containers"}, {"Count", 3}};
-  KSTErrorRef error = KSTCreateError("g", 9, kKSTErrorDomain, kKSTErrorWriteFailed, nullptr, &info,
-                                     false, "Failed to write metadata dictionary to URL %@", "/x");
-  EXPECT_EQ(*error->userInfo().at("Path").string(), "/private/var/containers");
-  EXPECT_EQ(error->userInfo().at("Count").signedInteger(), 3);
-  EXPECT_EQ(error->userInfo().size(), 5u);  // two given, description, function, line
-}
-
 TEST_F(ErrorsTest, CodeHandOverWidensTheSignedCodeAndSkipsAbsentTargets) {
   std::uint64_t code = kKSTSuccess;
   KSTHandOverCode(KST_ERROR(kKSTErrorDeleteFailed, nullptr, false, nullptr), &code);
   EXPECT_EQ(code, 28u);
-  KSTHandOverCode(KSTCreateError("f", 1, kKSTErrorDomain, -1, nullptr, nullptr, false, nullptr), &code);
+  KSTHandOverCode(KSTCreateError("f", 1, kKSTErrorDomain, -1, nullptr, nullptr, false, nullptr),
+                  &code);
   EXPECT_EQ(code, UINT64_MAX);
-  KSTHandOverCode(KSTCreateError("f", 1, kKSTErrorDomain, 0x100000005LL, nullptr, nullptr, false, nullptr), &code);
+  KSTHandOverCode(
+      KSTCreateError("f", 1, kKSTErrorDomain, 0x100000005LL, nullptr, nullptr, false, nullptr),
+      &code);
   EXPECT_EQ(code, 5u);
   KSTHandOverCode(KST_ERROR(kKSTErrorDeleteFailed, nullptr, false, nullptr), nullptr);  // no crash
 
@@ -72,9 +68,8 @@ TEST_F(ErrorsTest, CodeHandOverWidensTheSignedCodeAndSkipsAbsentTargets) {
 }
 
 int throwingOperation(std::uint64_t* code) {
-  return KST_CATCH_EXCEPTIONS(code, -1, [&]() -> int {
-    throw KSTException("InvalidArgumentException", "bad thing");
-  });
+  return KST_CATCH_EXCEPTIONS(
+      code, -1, [&]() -> int { throw KSTException("InvalidArgumentException", "bad thing"); });
 }
 
 TEST_F(ErrorsTest, ExceptionOnNonInternalBuildBecomesCode40AndTheDaemonGoesOn) {
@@ -96,16 +91,6 @@ TEST_F(ErrorsTest, ExceptionOnNonInternalBuildBecomesCode40AndTheDaemonGoesOn) {
   std::uint64_t untouched = kKSTSuccess;
   EXPECT_EQ(KST_CATCH_EXCEPTIONS(&untouched, 0, [] { return 7; }), 7);
   EXPECT_EQ(untouched, kKSTSuccess);
-}
-
-TEST_F(ErrorsTest, ReportTextHasTheFixedShape) {
-  CaughtException e{"RangeException", "index 3 beyond bounds", {"frame0", "frame1"}};
-  EXPECT_EQ(KSTExceptionReportText(e, "worker"),
-            "** INTERNAL ERROR: Uncaught Exception **\n"
-            "Exception: <worker> RangeException: index 3 beyond bounds\n"
-            "Stack:\nframe0\nframe1");
-  EXPECT_EQ(KSTExceptionReportText(CaughtException{"", "why", {}}, ""),
-            "** INTERNAL ERROR: Uncaught Exception **\nException: why\nStack:\n");
 }
 
 TEST_F(ErrorsTest, ExceptionOnInternalBuildWritesTheReportAndAborts) {

@@ -38,22 +38,9 @@ TEST_F(LogTest, LevelsFilterOnlyWhileThereIsAHandle) {
   EXPECT_TRUE(lines[1].withHandle);
 
   fakes.logging->clear();
-  Log::setCurrentLevel(kLogDebug);
-  writeOneOfEach();
-  EXPECT_EQ(fakes.logging->lines().size(), 3u);
-
-  fakes.logging->clear();
   Log::setCurrentLevel(kLogError);
   writeOneOfEach();
   EXPECT_EQ(fakes.logging->lines().size(), 1u);
-}
-
-TEST_F(LogTest, EveryLineIsTaggedWithTheWritingFunction) {
-  writeOneOfEach();
-  KSTLogTag(kLogNotice, "set_first_boot_work_completed", "tagged");
-  const auto lines = fakes.logging->lines();
-  EXPECT_EQ(lines[0].tag, "writeOneOfEach");
-  EXPECT_EQ(lines.back().tag, "set_first_boot_work_completed");
 }
 
 // The real disk log: one file of 102400 bytes on a customer build, four of

@@ -129,20 +129,6 @@ TEST_F(DeathRowTest, SweepEmptiesDeathRowUnderATransactionOnTheBackgroundQueue) 
   EXPECT_EQ(fakes.keepAlive->totalBegins(), 1u);
 }
 
-TEST_F(DeathRowTest, SweepOfAnAbsentOrUnreadableDeathRow) {
-  // An absent directory comes back empty.
-  fs::remove_all(deathRow());
-  EXPECT_EQ(sweep(), kKSTSuccess);
-
-  // A file where the directory belongs cannot be listed.
-  const std::string path = deathRow();
-  fs::remove_all(path);
-  std::ofstream(path) << "not a directory";
-  EXPECT_EQ(sweep(), kKSTErrorDeleteFailed);
-  EXPECT_TRUE(fakes.logged("Failed to get items for deletion: " + path + " : "));
-  EXPECT_TRUE(fs::is_regular_file(path));
-}
-
 TEST_F(DeathRowTest, EntryThatCannotBeRemovedGoesToTmp) {
   fs::create_directories(tmp());
   makeStuckTree(deathRow() + "/stuck");
@@ -175,21 +161,14 @@ TEST_F(DeathRowTest, EntryThatCanNeitherBeRemovedNorMovedFailsTheSweepButNotTheO
   EXPECT_TRUE(entries(deathRow()).empty());
 }
 
-TEST_F(DeathRowTest, RemoveOrMoveToTmp) {
-  // Missing: already gone.
-  KSTErrorRef error = KST_POSIX_ERROR(EIO, "stale");
-  EXPECT_TRUE(
-      client._removeItemOrMoveToTempAtURL(KSTFileURL(deathRow() + "/absent", true), &error));
-  EXPECT_EQ(error, nullptr);
-
-  // Neither removable nor movable: error 4 carrying the move's failure.
+TEST_F(DeathRowTest, RemoveOrMoveToTmpFailsWithTheMovesError) {
+  KSTErrorRef error;
   std::ofstream(tmp()) << "/tmp is a file here";
   const std::string stuck = fakes.scratch.resolve("/private/var/stuck");
   makeStuckTree(stuck);
   if (IsSkipped()) return;
   EXPECT_FALSE(client._removeItemOrMoveToTempAtURL(KSTFileURL(stuck, true), &error));
   ASSERT_NE(error, nullptr);
-  EXPECT_EQ(error->domain(), kKSTErrorDomain);
   EXPECT_EQ(error->code(), kKSTErrorMoveToTempFailed);
   EXPECT_EQ(error->localizedDescription(), "Failed to move dir: " + stuck + " to: " + tmp());
   ASSERT_NE(error->underlyingError(), nullptr);
@@ -213,40 +192,28 @@ TEST_F(DeathRowTest, MovesToDeathRowGetAHolderEach) {
   EXPECT_FALSE(fs::exists(second));
   const std::vector<std::string> holders = entries(deathRow());
   ASSERT_EQ(holders.size(), 2u);
-  int markers = 0;
   for (const std::string& holder : holders) {
-    SCOPED_TRACE(holder);
     EXPECT_EQ(holder.rfind("temp.", 0), 0u);
-    EXPECT_EQ(holder.size(), 11u);
     EXPECT_EQ(entries(deathRow() + "/" + holder), std::vector<std::string>{"Data"});
-    markers += fs::exists(deathRow() + "/" + holder + "/Data/marker") ? 1 : 0;
   }
-  EXPECT_EQ(markers, 1);
   EXPECT_EQ(fakes.keepAlive->totalBegins(), 0u);  // no sweep was asked for
 }
 
-TEST_F(DeathRowTest, MoveOfAMissingItemSucceedsWithoutASweep) {
+TEST_F(DeathRowTest, MoveWithDeletionStartsASweepUnlessTheItemIsMissing) {
   KSTErrorRef error;
   EXPECT_TRUE(client._moveItemAtURLToDeathRow(
       KSTFileURL(fakes.scratch.resolve("/private/var/gone"), true), true, true, &error));
   EXPECT_EQ(error, nullptr);
   KSTDeathRowQueue()->sync([] {});
   EXPECT_EQ(fakes.keepAlive->totalBegins(), 0u);
-  // The empty holder stays for the next sweep.
-  ASSERT_EQ(entries(deathRow()).size(), 1u);
-  EXPECT_EQ(sweep(), kKSTSuccess);
-  EXPECT_TRUE(entries(deathRow()).empty());
-}
+  ASSERT_EQ(entries(deathRow()).size(), 1u);  // the empty holder stays for the next sweep
 
-TEST_F(DeathRowTest, MoveWithDeletionStartsASweep) {
   const std::string item = fakes.scratch.resolve("/private/var/old/Container");
   makeTree(item);
-  KSTErrorRef error;
   EXPECT_TRUE(client._moveItemAtURLToDeathRow(KSTFileURL(item, true), true, true, &error));
   KSTDeathRowQueue()->sync([] {});
   EXPECT_EQ(fakes.keepAlive->totalBegins(), 1u);
   EXPECT_TRUE(entries(deathRow()).empty());
-  EXPECT_FALSE(fs::exists(item));
 }
 
 TEST_F(DeathRowTest, MoveToDeathRowFailures) {
@@ -297,14 +264,14 @@ TEST_F(DeathRowTest, CommandRepliesWithTheSweepsCodeOnceItEnded) {
   EXPECT_EQ(connection->lastReply()->size(), 1u);
   EXPECT_TRUE(entries(deathRow()).empty());
 
-  // A failed sweep is the reply's code.
+  // A failed sweep (death row cannot be listed) is the reply's code.
   const std::string path = deathRow();
   fs::remove_all(path);
   std::ofstream(path) << "not a directory";
   ASSERT_TRUE(connection->deliver(request));
   ASSERT_TRUE(connection->waitForReplies(2, 20s));
   EXPECT_EQ(connection->lastReply()->uint64(kKSTReplyErrorKey), kKSTErrorDeleteFailed);
-  EXPECT_FALSE(connection->cancelled());
+  EXPECT_TRUE(fakes.logged("Failed to get items for deletion: " + path + " : "));
 }
 
 }  // namespace

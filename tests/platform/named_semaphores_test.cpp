@@ -28,10 +28,7 @@ class RemoveOnExit {
 };
 
 TEST(NamedSemaphoresTest, NamesAreScopedToTheRoot) {
-  EXPECT_EQ(scopedSemaphoreName(FilesystemRoot("/"), "kestreld.fb_check"), "/kestreld.fb_check");
   EXPECT_EQ(scopedSemaphoreName(FilesystemRoot("/"), "/kestreld.fb_check"), "/kestreld.fb_check");
-  // FNV-1a 64 of "a" is af63dc4c8601ec8c.
-  EXPECT_EQ(scopedSemaphoreName(FilesystemRoot("a"), "x"), "/x.af63dc4c8601ec8c");
 
   const std::string scoped = scopedSemaphoreName(FilesystemRoot("/tmp/r1"), "kestreld.fb_check");
   EXPECT_TRUE(std::regex_match(scoped, std::regex(R"(/kestreld\.fb_check\.[0-9a-f]{16})")))

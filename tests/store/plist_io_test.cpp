@@ -121,15 +121,5 @@ TEST_F(PlistIOTest, FailedWritesLeaveTheOldFileAndNoTemporaryFile) {
   EXPECT_EQ(namesInDirectory(), std::vector<std::string>{"meta.plist"});
 }
 
-TEST_F(PlistIOTest, PathBytesBecomeStrings) {
-  EXPECT_EQ(stringWithFileSystemRepresentation("/private/var/containers"),
-            "/private/var/containers");
-  EXPECT_EQ(stringWithFileSystemRepresentation("/a/bcdef", 4), "/a/b");
-  EXPECT_EQ(stringWithFileSystemRepresentation("/a\0/b", 5), "/a");
-  EXPECT_EQ(stringWithFileSystemRepresentation("caf\xC3\xA9"), "caf\xC3\xA9");
-  EXPECT_EQ(stringWithFileSystemRepresentation(nullptr), "");
-  EXPECT_EQ(stringWithFileSystemRepresentation(nullptr, 3), "");
-}
-
 }  // namespace
 }  // namespace kestrel
