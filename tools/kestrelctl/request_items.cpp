@@ -48,12 +48,21 @@ std::optional<platform::MessageData> parseHex(std::string_view text) {
   return out;
 }
 
-std::optional<PlistValue> fromJson(const nlohmann::json& json, std::string* error) {
+// Far deeper than any request can travel, and shallow enough that the
+// conversion (one call a level) cannot run out of stack.
+constexpr std::size_t kMaxJsonDepth = 256;
+
+std::optional<PlistValue> fromJson(const nlohmann::json& json, std::size_t depth,
+                                   std::string* error) {
+  if (depth > kMaxJsonDepth && (json.is_object() || json.is_array())) {
+    *error = "nested deeper than " + std::to_string(kMaxJsonDepth) + " levels";
+    return std::nullopt;
+  }
   switch (json.type()) {
     case nlohmann::json::value_t::object: {
       PlistDictionary out;
       for (const auto& [key, value] : json.items()) {
-        auto converted = fromJson(value, error);
+        auto converted = fromJson(value, depth + 1, error);
         if (!converted) return std::nullopt;
         out.emplace(key, std::move(*converted));
       }
@@ -62,7 +71,7 @@ std::optional<PlistValue> fromJson(const nlohmann::json& json, std::string* erro
     case nlohmann::json::value_t::array: {
       PlistArray out;
       for (const auto& value : json) {
-        auto converted = fromJson(value, error);
+        auto converted = fromJson(value, depth + 1, error);
         if (!converted) return std::nullopt;
         out.push_back(std::move(*converted));
       }
@@ -97,7 +106,7 @@ std::optional<PlistValue> plistFromJson(std::string_view json, std::string* erro
     *error = "not valid JSON";
     return std::nullopt;
   }
-  return fromJson(parsed, error);
+  return fromJson(parsed, 1, error);
 }
 
 bool addRequestItem(std::string_view item, platform::MessageDictionary* request,

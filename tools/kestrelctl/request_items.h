@@ -17,7 +17,8 @@ bool addRequestItem(std::string_view item, platform::MessageDictionary* request,
 
 // A JSON text as a property list: objects, arrays, strings, booleans, integers
 // (signed unless too large for int64) and reals. Nothing, with a message, for
-// malformed JSON or a null, which has no property-list form.
+// malformed JSON, a null (which has no property-list form) or containers
+// nested more than 256 levels deep.
 std::optional<PlistValue> plistFromJson(std::string_view json, std::string* error);
 
 }  // namespace kestrel::kestrelctl
