@@ -57,7 +57,9 @@ scratch_parent=/dev/shm
 [[ -d "$scratch_parent" && -w "$scratch_parent" ]] || scratch_parent=${TMPDIR:-/tmp}
 export KESTREL_FUZZ_SCRATCH
 KESTREL_FUZZ_SCRATCH=$(mktemp -d "$scratch_parent/kestrel-fuzz-run.XXXXXX")
-trap 'rm -rf "$KESTREL_FUZZ_SCRATCH"' EXIT
+fuzzer=
+trap '[[ -n "$fuzzer" ]] && kill "$fuzzer" 2>/dev/null; rm -rf "$KESTREL_FUZZ_SCRATCH"' EXIT
+trap 'exit 130' INT TERM
 
 # A 64 MB quarantine still holds far more than one input frees, and ten frames
 # of allocation and free stacks are enough to place a report; the defaults
@@ -99,8 +101,16 @@ for target in "${targets[@]}"; do
   echo "fuzz: $target for ${seconds}s"
   start=$(date +%s)
   set +e
-  (cd "$dir" && nice -n 19 "$binary" "${args[@]}" "$dir/corpus" </dev/null >"$dir/log" 2>&1)
+  # Where the kernel groups tasks by session (autogroup), nice only ranks tasks
+  # within their own session: the fuzzer gets a session of its own whose group
+  # is niced, so that builds and benchmarks beside it keep their share. Being
+  # in another session it misses a terminal's Ctrl-C; the traps stop it.
+  (cd "$dir" && exec setsid -w bash -c 'echo 19 >/proc/self/autogroup 2>/dev/null; exec nice -n 19 "$@"' \
+    fuzz "$binary" "${args[@]}" "$dir/corpus" </dev/null >"$dir/log" 2>&1) &
+  fuzzer=$!
+  wait "$fuzzer"
   rc=$?
+  fuzzer=
   set -e
   elapsed=$(($(date +%s) - start))
   runs=$(sed -n 's/^stat::number_of_executed_units: *//p' "$dir/log" | tail -1)
