@@ -18,7 +18,7 @@ fi
 
 cmake -S "$source_dir" -B "$build_dir" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
   -DKESTREL_BUILD_BENCHMARKS=ON -DKESTREL_BUILD_TESTS=OFF >/dev/null
-cmake --build "$build_dir" --target kestreld kestrel_request_bench -j2
+cmake --build "$build_dir" --target kestreld kestrelctl kestrel_request_bench -j2
 
 root="$("$source_dir/tools/make-scratch-root.sh")"
 bench="$(readlink -f "$build_dir/bench/kestrel_request_bench")"
@@ -37,7 +37,7 @@ PLIST
 socket="$root/run/kestrel/com.zorvane.kestreld"
 KESTREL_ROOT="$root" "$build_dir/kestreld" 2>/dev/null &
 pid=$!
-trap 'kill -TERM $pid 2>/dev/null || true; wait $pid 2>/dev/null || true; "$source_dir/tools/remove-scratch-root.sh" "$root"' EXIT
+trap 'kill -TERM $pid 2>/dev/null || true; wait $pid 2>/dev/null || true; KESTRELCTL="$build_dir/tools/kestrelctl" "$source_dir/tools/remove-scratch-root.sh" "$root"' EXIT
 for _ in $(seq 200); do [[ -S "$socket" ]] && break; sleep 0.05; done
 
 out="$here/results/request-$(date -u +%Y%m%dT%H%M%SZ)"

@@ -39,7 +39,7 @@ cleanup() {
   kill -TERM "$pid" 2>/dev/null || true
   wait "$pid" 2>/dev/null || true
   # A failed run keeps its root for a look at the store and the log.
-  if [[ $status == 0 ]]; then tools/remove-scratch-root.sh "$root"; else echo "root kept: $root"; fi
+  if [[ $status == 0 ]]; then KESTRELCTL="$build_dir/tools/kestrelctl" tools/remove-scratch-root.sh "$root"; else echo "root kept: $root"; fi
 }
 trap cleanup EXIT
 for _ in $(seq 200); do [[ -S "$socket" ]] && break; sleep 0.05; done

@@ -24,9 +24,11 @@
 
 #include "client.h"
 #include "commands.h"
+#include "daemon/daemon_state.h"
 #include "fsck.h"
 #include "human_output.h"
 #include "platform/linux/dbus_listener.h"
+#include "platform/linux/named_semaphores_linux.h"
 #include "platform/plist_serialization.h"
 #include "platform/root.h"
 #include "platform/services.h"
@@ -201,6 +203,19 @@ int runPlist(const std::string& file) {
   return kExitSuccess;
 }
 
+// Removes the mark that the boot-time work was done for this root, so that
+// the daemon's next start does it again. Beneath a root other than /, the
+// mark is a named semaphore in /dev/shm that outlives the root: removing a
+// scratch root should remove it too. The daemon is not asked.
+int runResetFirstBoot(const platform::FilesystemRoot& root) {
+  platform::LinuxNamedSemaphores semaphores(root);
+  const bool marked = semaphores.openExisting(kKSTFirstBootSemaphoreName);
+  if (marked) semaphores.remove(kKSTFirstBootSemaphoreName);
+  std::cout << (marked ? "removed " : "not present: ")
+            << platform::scopedSemaphoreName(root, kKSTFirstBootSemaphoreName) << "\n";
+  return kExitSuccess;
+}
+
 // The store's own messages go nowhere while fsck runs: it reports what it
 // finds itself, with the reasons.
 class SilentLogging : public platform::Logging {
@@ -313,6 +328,11 @@ int run(int argc, char** argv) {
   fsck->add_flag("--offline", offline, "Check the disk alone; do not ask the daemon");
   fsck->fallthrough();
 
+  CLI::App* resetFirstBoot = app.add_subcommand(
+      "reset-first-boot",
+      "Forget that the boot-time work was done for the root (the daemon's next start redoes it)");
+  resetFirstBoot->fallthrough();
+
   // Sized up front: the options keep pointers into their entries.
   std::vector<NamedArguments> named(kestrelctl::subcommands().size());
   for (std::size_t i = 0; i < named.size(); ++i) {
@@ -335,6 +355,7 @@ int run(int argc, char** argv) {
   if (address.empty()) {
     address = "unix:path=" + platform::messageServiceSocketPath(filesystemRoot, kServiceName);
   }
+  if (resetFirstBoot->parsed()) return runResetFirstBoot(filesystemRoot);
   if (fsck->parsed()) return runFsck(filesystemRoot, address, offline, timeoutSeconds);
   for (std::size_t i = 0; i < named.size(); ++i) {
     if (named[i].app->parsed()) {
