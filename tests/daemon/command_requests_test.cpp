@@ -7,6 +7,7 @@
 #include <limits>
 
 #include "daemon/error_codes.h"
+#include "daemon/request_dispatch.h"
 #include "support/fake_services.h"
 
 namespace kestrel {
@@ -35,15 +36,29 @@ MessageValue nestedTooDeep() {
   return value;
 }
 
+// A request naming a class and a user (0: no "UserID").
+MessageDictionary classAndUser(std::uint64_t containerClass, std::uint64_t user) {
+  MessageDictionary request;
+  request.setUint64("ContainerClass", containerClass);
+  if (user != 0) request.setUint64("UserID", user);
+  return request;
+}
+
+// The user a decoder resolves, or nothing when it refuses.
+template <auto decode>
+std::optional<std::uint32_t> userOf(const MessageDictionary& request,
+                                    const KSTClientConnection& client, std::uint64_t* code) {
+  const auto decoded = decode(request, client, code);
+  return decoded ? std::optional(decoded->userId) : std::nullopt;
+}
+
 class CommandRequestsTest : public ::testing::Test {
  protected:
   testing::FakeServices fakes;
 };
 
 TEST_F(CommandRequestsTest, MissingKeysReadAsTheirDefaultsAndOwnIdentifierFallsBackToTheClient) {
-  MessageDictionary request;
-  request.setUint64("ContainerClass", 2);
-  request.setUint64("UserID", 1);
+  MessageDictionary request = classAndUser(2, 1);
   std::uint64_t code = kKSTSuccess;
 
   auto created = KSTDecodeCreateOrLookupRequest(request, mobileClient(), &code);
@@ -70,49 +85,43 @@ TEST_F(CommandRequestsTest, MissingKeysReadAsTheirDefaultsAndOwnIdentifierFallsB
   EXPECT_EQ(code, kKSTSuccess);
 }
 
-TEST_F(CommandRequestsTest, WrongTypedKeyIsRefusedWith38AndLogged) {
-  using Decode = std::function<bool(const MessageDictionary&, std::uint64_t*)>;
-  const KSTClientConnection client = mobileClient();
-  const Decode create = [&](const MessageDictionary& r, std::uint64_t* e) {
-    return KSTDecodeCreateOrLookupRequest(r, client, e).has_value();
-  };
-  const Decode setInfo = [&](const MessageDictionary& r, std::uint64_t* e) {
-    return KSTDecodeSetInfoValueRequest(r, client, e).has_value();
-  };
-  const Decode protection = [&](const MessageDictionary& r, std::uint64_t* e) {
-    return KSTDecodeDataProtectionRequest(r, client, e).has_value();
-  };
-  const Decode stage = [&](const MessageDictionary& r, std::uint64_t* e) {
-    return KSTDecodeStageForDeleteRequest(r, client, e).has_value();
-  };
+// The decoder of that name for a mobile client of user 501, and its name (the tag it logs with).
+#define DECODER(name)                   \
+#name, [](const MessageDictionary& r, \
+            std::uint64_t* e) { return name(r, mobileClient(), e).has_value(); }
+
+TEST_F(CommandRequestsTest, BadlyTypedOrOutOfRangeKeyIsRefusedWith38AndLogged) {
+  constexpr std::int64_t kMax = std::numeric_limits<std::int32_t>::max();
+  constexpr std::int64_t kMin = std::numeric_limits<std::int32_t>::min();
   struct Row {
     const char* tag;
-    Decode decode;
+    std::function<bool(const MessageDictionary&, std::uint64_t*)> decode;
     const char* key;
     MessageValue value;
-    const char* message;
+    const char* message;  // after "Request key \"<key>\" "
   } rows[] = {
-      {"KSTDecodeCreateOrLookupRequest", create, "ContainerClass", MessageValue::fromString("2"),
-       "Request key \"ContainerClass\" holds a string, not a uint64"},
-      {"KSTDecodeCreateOrLookupRequest", create, "Identifier", MessageValue::fromUint64(7),
-       "Request key \"Identifier\" holds a uint64, not a string"},
-      {"KSTDecodeCreateOrLookupRequest", create, "CreateIfNecessary", MessageValue::fromUint64(1),
-       "Request key \"CreateIfNecessary\" holds a uint64, not a boolean"},
-      {"KSTDecodeSetInfoValueRequest", setInfo, "UUID", MessageValue::fromData({1, 2, 3}),
-       "Request key \"UUID\" holds a data, not a UUID"},
-      {"KSTDecodeSetInfoValueRequest", setInfo, "Value", nestedTooDeep(),
-       "Request key \"Value\" is nested too deep to read"},
-      {"KSTDecodeDataProtectionRequest", protection, "DataProtectionClass",
-       MessageValue::fromUint64(3),
-       "Request key \"DataProtectionClass\" holds a uint64, not a int64"},
-      {"KSTDecodeStageForDeleteRequest", stage, "UserIDsArray", MessageValue::fromDictionary({}),
-       "Request key \"UserIDsArray\" holds a dictionary, not a array"},
+      {DECODER(KSTDecodeCreateOrLookupRequest), "ContainerClass", MessageValue::fromString("2"),
+       "holds a string, not a uint64"},
+      {DECODER(KSTDecodeCreateOrLookupRequest), "Identifier", MessageValue::fromUint64(7),
+       "holds a uint64, not a string"},
+      {DECODER(KSTDecodeCreateOrLookupRequest), "CreateIfNecessary", MessageValue::fromUint64(1),
+       "holds a uint64, not a boolean"},
+      {DECODER(KSTDecodeSetInfoValueRequest), "UUID", MessageValue::fromData({1, 2, 3}),
+       "holds a data, not a UUID"},
+      {DECODER(KSTDecodeSetInfoValueRequest), "Value", nestedTooDeep(),
+       "is nested too deep to read"},
+      {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass", MessageValue::fromUint64(3),
+       "holds a uint64, not a int64"},
+      {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass",
+       MessageValue::fromInt64(kMax + 1), "holds 2147483648, beyond any protection class"},
+      {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass",
+       MessageValue::fromInt64(kMin - 1), "holds -2147483649, beyond any protection class"},
+      {DECODER(KSTDecodeStageForDeleteRequest), "UserIDsArray", MessageValue::fromDictionary({}),
+       "holds a dictionary, not a array"},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.message);
-    MessageDictionary request;
-    request.setUint64("ContainerClass", 2);
-    request.setUint64("UserID", 501);
+    MessageDictionary request = classAndUser(2, 501);
     request.set(row.key, row.value);
     fakes.logging->clear();
     std::uint64_t code = kKSTSuccess;
@@ -120,57 +129,81 @@ TEST_F(CommandRequestsTest, WrongTypedKeyIsRefusedWith38AndLogged) {
     EXPECT_EQ(code, kKSTErrorInvalidParameter);
     ASSERT_EQ(fakes.logging->lines().size(), 1u);
     EXPECT_EQ(fakes.logging->lines()[0].level, 3);
-    EXPECT_TRUE(fakes.logging->contains(row.tag, row.message));
+    const std::string message = "Request key \"" + std::string(row.key) + "\" " + row.message;
+    EXPECT_TRUE(fakes.logging->contains(row.tag, message));
     EXPECT_FALSE(row.decode(request, nullptr));
+  }
+  // Protection classes that fit 32 bits are taken as they are.
+  for (const std::int64_t value : {std::int64_t{-1}, kMin, kMax}) {
+    MessageDictionary request = classAndUser(2, 501);
+    request.setInt64("DataProtectionClass", value);
+    std::uint64_t code = kKSTSuccess;
+    const auto decoded = KSTDecodeDataProtectionRequest(request, mobileClient(), &code);
+    ASSERT_TRUE(decoded) << value;
+    EXPECT_EQ(decoded->dataProtectionClass, value);
+    EXPECT_EQ(code, kKSTSuccess);
   }
 }
 
-TEST_F(CommandRequestsTest, UserIdsAreCheckedAgainstTheCommandsClass) {
+// validateUserId, and the decoders that check "UserID" with it against their command's class.
+TEST_F(CommandRequestsTest, UserIdsResolveByClassAndClient) {
   using Decode = std::function<std::optional<std::uint32_t>(
       const MessageDictionary&, const KSTClientConnection&, std::uint64_t*)>;
-  const Decode create = [](const auto& r, const auto& c, auto* e) -> std::optional<std::uint32_t> {
-    auto d = KSTDecodeCreateOrLookupRequest(r, c, e);
-    return d ? std::optional(d->userId) : std::nullopt;
-  };
-  const Decode wipePlugin = [](const auto& r, const auto& c,
-                               auto* e) -> std::optional<std::uint32_t> {
-    auto d = KSTDecodeWipePluginContainerRequest(r, c, e);
-    if (d) {
-      EXPECT_EQ(d->containerClass, kKSTContainerClassDataVantlerPlugin);
-    }
-    return d ? std::optional(d->userId) : std::nullopt;
-  };
-  const Decode appGroup = [](const auto& r, const auto& c,
+  const Decode validate = [](const auto& r, const auto& c,
                              auto* e) -> std::optional<std::uint32_t> {
-    auto d = KSTDecodeAppGroupRequest(r, c, e);
-    return d ? std::optional(d->userId) : std::nullopt;
+    std::uint32_t resolved = 77;
+    const auto user = static_cast<std::uint32_t>(r.uint64("UserID"));
+    if (validateUserId(user, r.uint64("ContainerClass"), c.clientUserId(), &resolved, e)) {
+      return resolved;
+    }
+    EXPECT_EQ(resolved, 77u);  // untouched when refused
+    return std::nullopt;
   };
+  const Decode create = userOf<KSTDecodeCreateOrLookupRequest>;
+  const Decode wipePlugin = userOf<KSTDecodeWipePluginContainerRequest>;
+  const Decode appGroup = userOf<KSTDecodeAppGroupRequest>;
   struct Row {
     const char* label;
     Decode decode;
     std::uint64_t containerClass;  // "ContainerClass" of the request
-    std::uint64_t user;
+    std::uint64_t user;            // "UserID" of the request; 0: none
     std::uint32_t clientUser;
     std::optional<std::uint32_t> resolved;  // nullopt: 38
   } rows[] = {
-      {"bundle class takes the installer", create, 1, 33, 0, 33},
-      {"only the low 32 bits count", create, 2, (std::uint64_t{7} << 32) | 502, 0, 502},
-      {"mobile client names another user", create, 2, 502, 501, std::nullopt},
-      {"wipe ignores the request's class (4)", wipePlugin, 1, 501, 0, 501},
-      {"wipe checks against class 4", wipePlugin, 2, 33, 0, std::nullopt},
-      {"app groups refuse the installer", appGroup, 1, 33, 0, std::nullopt},
-      {"missing user is 0, never valid", create, 2, 0, 0, std::nullopt},
+      {"system client, user 1 is the current mobile user", validate, 2, 1, 0, 501},
+      {"system client, another mobile user", validate, 2, 502, 0, 502},
+      {"system client, user 500 is no mobile user", validate, 2, 500, 0, std::nullopt},
+      {"bundle class needs the installer", validate, 1, 33, 0, 33},
+      {"bundle class refuses user 1", validate, 3, 1, 0, std::nullopt},
+      {"system class needs 499", validate, 12, 499, 501, 499},
+      {"system group class refuses 0", validate, 13, 0, 0, std::nullopt},
+      {"class 14 is never valid", validate, 14, 501, 0, std::nullopt},
+      {"user process names user 1", validate, 7, 1, 501, 501},
+      {"user process names another user", validate, 2, 502, 501, std::nullopt},
+      {"decoded: bundle class takes the installer", create, 1, 33, 0, 33},
+      {"decoded: only the low 32 bits count", create, 2, (std::uint64_t{7} << 32) | 502, 0, 502},
+      {"decoded: mobile client names another user", create, 2, 502, 501, std::nullopt},
+      {"decoded: wipe ignores the request's class (4)", wipePlugin, 1, 501, 0, 501},
+      {"decoded: wipe checks against class 4", wipePlugin, 2, 33, 0, std::nullopt},
+      {"decoded: app groups refuse the installer", appGroup, 1, 33, 0, std::nullopt},
+      {"decoded: missing user is 0, never valid", create, 2, 0, 0, std::nullopt},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.label);
-    MessageDictionary request;
-    request.setUint64("ContainerClass", row.containerClass);
-    if (row.user != 0) request.setUint64("UserID", row.user);
+    const MessageDictionary request = classAndUser(row.containerClass, row.user);
     const KSTClientConnection client("com.example.client", row.clientUser, false, std::nullopt);
     std::uint64_t code = kKSTSuccess;
     EXPECT_EQ(row.decode(request, client, &code), row.resolved);
     EXPECT_EQ(code, row.resolved ? kKSTSuccess : kKSTErrorInvalidParameter);
   }
+  EXPECT_TRUE(
+      fakes.logging->contains("validateUserId", "Invalid userId 502 for class 2 from client 501"));
+  EXPECT_EQ(KSTDecodeWipePluginContainerRequest(classAndUser(1, 501), systemClient(), nullptr)
+                ->containerClass,
+            kKSTContainerClassDataVantlerPlugin);
+  fakes.logging->clear();
+  EXPECT_FALSE(validateUserId(502, 2, 501, nullptr, nullptr));
+  EXPECT_TRUE(fakes.logging->lines().empty());  // no code pointer: no log line
 }
 
 TEST_F(CommandRequestsTest, ReplaceReadsTheOldKeysOnlyWithAnOldUUID) {
@@ -253,29 +286,6 @@ TEST_F(CommandRequestsTest, StageForDeleteArrays) {
   EXPECT_EQ(code, kKSTErrorInvalidObject);
   EXPECT_TRUE(fakes.logging->contains("KSTDecodeStageForDeleteRequest",
                                       "Can't act on an invalid input: 2 user ids, 1 classes"));
-}
-
-TEST_F(CommandRequestsTest, ProtectionClassMustFitThirtyTwoBits) {
-  constexpr std::int64_t kMax = std::numeric_limits<std::int32_t>::max();
-  constexpr std::int64_t kMin = std::numeric_limits<std::int32_t>::min();
-  const struct {
-    std::int64_t value;
-    bool accepted;
-  } rows[] = {{-1, true}, {kMin, true}, {kMax, true}, {kMax + 1, false}, {kMin - 1, false}};
-  for (const auto& row : rows) {
-    SCOPED_TRACE(row.value);
-    MessageDictionary request;
-    request.setUint64("ContainerClass", 2);
-    request.setUint64("UserID", 501);
-    request.setInt64("DataProtectionClass", row.value);
-    std::uint64_t code = kKSTSuccess;
-    auto decoded = KSTDecodeDataProtectionRequest(request, mobileClient(), &code);
-    ASSERT_EQ(decoded.has_value(), row.accepted);
-    if (row.accepted) {
-      EXPECT_EQ(decoded->dataProtectionClass, row.value);
-    }
-    EXPECT_EQ(code, row.accepted ? kKSTSuccess : kKSTErrorInvalidParameter);
-  }
 }
 
 TEST_F(CommandRequestsTest, ContainerRepliesCarryPathUUIDAndIdentifier) {

@@ -1,6 +1,8 @@
 // The real daemon on a scratch root, talked to by separate client processes
-// that carry different registered identities.
+// (copies of kestrelctl) that carry different registered identities.
 #include <gtest/gtest.h>
+
+#include <filesystem>
 
 #include "platform/linux/named_semaphores_linux.h"
 #include "support/registered_clients.h"
@@ -8,7 +10,10 @@
 namespace kestrel {
 namespace {
 
+namespace fs = std::filesystem;
 using EndToEndTest = testing::RegisteredClientsTest;
+
+constexpr const char* kDeathRow = "/private/var/root/Library/Caches/com.zorvane.kestreld/Dead";
 
 TEST_F(EndToEndTest, ClientsAreAnsweredOrRefusedByTheirRegisteredEntitlements) {
   testing::DaemonProcess daemon(scratch.path());
@@ -30,6 +35,25 @@ TEST_F(EndToEndTest, ClientsAreAnsweredOrRefusedByTheirRegisteredEntitlements) {
 
   // The daemon still serves after refusing.
   EXPECT_EQ(call("allowed-client", {"25", "UserID=u64:1"}).exitStatus, 0);
+
+  // kestrelctl's named subcommands print for people, or as JSON.
+  scratch.writeFile(std::string(kDeathRow) + "/temp.a1b2c3/Data/Library/Preferences/a.plist", "a");
+  scratch.writeFile(std::string(kDeathRow) + "/5F1C0E2A-UUID/Documents/b", "b");
+  auto refused = ctl("plain-client", {"sweep"});
+  EXPECT_EQ(refused.exitStatus, 4) << refused.output;
+  EXPECT_FALSE(fs::is_empty(scratch.resolve(kDeathRow)));
+  auto swept = ctl("allowed-client", {"sweep"});
+  EXPECT_EQ(swept.exitStatus, 0) << swept.output;
+  EXPECT_EQ(swept.output, "death row swept\n");
+  EXPECT_TRUE(fs::is_empty(scratch.resolve(kDeathRow)));
+  scratch.writeFile(std::string(kDeathRow) + "/temp.d4e5f6/Documents/b", "b");
+  auto json = ctl("allowed-client", {"--json", "sweep"});
+  EXPECT_EQ(json.exitStatus, 0) << json.output;
+  EXPECT_EQ(json.output, "{\n  \"ReplyError\": 1\n}\n");
+  EXPECT_TRUE(fs::is_empty(scratch.resolve(kDeathRow)));
+  auto unknown = ctl("allowed-client", {"code-signing-info", "--identifier", "com.example.none"});
+  EXPECT_EQ(unknown.exitStatus, 1) << unknown.output;
+  EXPECT_EQ(unknown.output, "kestrelctl: code-signing-info failed: error 21 (not found)\n");
   EXPECT_EQ(daemon.stop(), 0);
 
   const std::string text = log();
@@ -62,10 +86,13 @@ TEST_F(EndToEndTest, OnlyTheFirstStartSinceBootDoesTheBootTimeWork) {
   EXPECT_EQ(count("kestreld performing first boot initialization"), 1u);
   EXPECT_EQ(count("Received signal 15, exiting"), 2u);
 
-  // "Reboot": the mark goes, so the next start repeats the boot-time work.
-  platform::LinuxNamedSemaphores(scratch.root()).remove("kestreld.fb_check");
+  // "Reboot": kestrelctl takes the mark away, so the next start repeats the boot-time work.
+  const std::string mark = platform::scopedSemaphoreName(scratch.root(), "kestreld.fb_check");
+  EXPECT_EQ(ctl("plain-client", {"reset-first-boot"}).output, "removed " + mark + "\n");
+  EXPECT_EQ(ctl("plain-client", {"reset-first-boot"}).output, "not present: " + mark + "\n");
   startAndStop();
   EXPECT_EQ(count("kestreld performing first boot initialization"), 2u);
+  EXPECT_EQ(ctl("plain-client", {"reset-first-boot"}).output, "removed " + mark + "\n");
 }
 
 }  // namespace

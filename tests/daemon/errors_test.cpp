@@ -14,7 +14,19 @@ class ErrorsTest : public ::testing::Test {
   testing::FakeServices fakes;
 };
 
-TEST_F(ErrorsTest, ErrorCarriesMessageFunctionAndLineAndLogsIt) {
+TEST_F(ErrorsTest, ErrorsKeepTheirOriginAndLogOnlyWhenAskedTo) {
+  // Silent and formatless errors log nothing but keep their origin.
+  KSTErrorRef silent = KST_ERROR(kKSTErrorNotFound, nullptr, false,
+                                 "Container with identifier: \"%@\" Not Found", "x");
+  KSTErrorRef bare = KSTCreateError("f", 5, kKSTErrorDomain, kKSTErrorException,
+                                    KST_POSIX_ERROR(EIO, "io"), nullptr, true, nullptr);
+  EXPECT_TRUE(fakes.logging->lines().empty());
+  EXPECT_EQ(silent->localizedDescription(), "Container with identifier: \"x\" Not Found");
+  EXPECT_FALSE(bare->localizedDescription().has_value());
+  EXPECT_EQ(*bare->userInfo().at(kKSTFunctionNameKey).string(), "f");
+  EXPECT_EQ(bare->userInfo().at(kKSTSourceFileLineKey).signedInteger(), 5);
+
+  // A logged error carries its message, function and line, and logs them.
   KSTErrorRef underlying = KST_POSIX_ERROR(ENOENT, "open failed");
   KSTErrorRef error =
       KSTCreateError("makeThing", 77, kKSTErrorDomain, kKSTErrorNotFound, underlying, nullptr, true,
@@ -35,18 +47,6 @@ TEST_F(ErrorsTest, ErrorCarriesMessageFunctionAndLineAndLogsIt) {
   EXPECT_EQ(lines.back().level, kLogError);
   EXPECT_EQ(lines.back().tag, "TestBody");
   EXPECT_TRUE(lines.back().message.ends_with(": Can't act on an invalid object: userId: 3"));
-}
-
-TEST_F(ErrorsTest, SilentAndFormatlessErrorsLogNothingButKeepTheirOrigin) {
-  KSTErrorRef silent = KST_ERROR(kKSTErrorNotFound, nullptr, false,
-                                 "Container with identifier: \"%@\" Not Found", "x");
-  KSTErrorRef bare = KSTCreateError("f", 5, kKSTErrorDomain, kKSTErrorException,
-                                    KST_POSIX_ERROR(EIO, "io"), nullptr, true, nullptr);
-  EXPECT_TRUE(fakes.logging->lines().empty());
-  EXPECT_EQ(silent->localizedDescription(), "Container with identifier: \"x\" Not Found");
-  EXPECT_FALSE(bare->localizedDescription().has_value());
-  EXPECT_EQ(*bare->userInfo().at(kKSTFunctionNameKey).string(), "f");
-  EXPECT_EQ(bare->userInfo().at(kKSTSourceFileLineKey).signedInteger(), 5);
 }
 
 TEST_F(ErrorsTest, CodeHandOverWidensTheSignedCodeAndSkipsAbsentTargets) {
@@ -76,14 +76,11 @@ TEST_F(ErrorsTest, ExceptionOnNonInternalBuildBecomesCode40AndTheDaemonGoesOn) {
   std::uint64_t code = kKSTSuccess;
   EXPECT_EQ(throwingOperation(&code), -1);
   EXPECT_EQ(code, kKSTErrorException);
-  bool logged = false;
-  for (const auto& line : fakes.logging->lines()) {
-    if (line.tag == "throwingOperation" && line.level == kLogError &&
-        line.message.find(": Got exception: bad thing : (") != std::string::npos) {
-      logged = true;
-    }
-  }
-  EXPECT_TRUE(logged);
+  const auto lines = fakes.logging->lines();
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_EQ(lines[0].tag, "throwingOperation");
+  EXPECT_EQ(lines[0].level, kLogError);
+  EXPECT_NE(lines[0].message.find(": Got exception: bad thing : ("), std::string::npos);
 
   std::uint64_t other = kKSTSuccess;
   KST_CATCH_EXCEPTIONS(&other, [] { throw std::runtime_error("std failure"); });

@@ -9,6 +9,7 @@
 #include <functional>
 #include <future>
 #include <memory>
+#include <optional>
 #include <random>
 #include <string>
 #include <thread>
@@ -27,20 +28,28 @@ using namespace std::chrono_literals;
 constexpr auto kSettle = 100ms;
 constexpr auto kPatience = 10s;
 
-// Takes a lock on a thread of its own and holds it until release(). The body
-// takes the lock (through a guard) and calls hold() while holding it. A holder
-// that is still waiting when it is released is a failure, not a hang: its
-// thread is left behind, blocked, with the state it shares.
+// Which lock a holder takes: that of one identifier, or of all of them.
+constexpr std::nullopt_t kAll = std::nullopt;
+
+// Takes a lock on a thread of its own (through a guard) and holds it until
+// release(). A holder that is still waiting when it is released is a failure,
+// not a hang: its thread is left behind, blocked, with the state it shares.
 class LockHolder {
  public:
-  using Body = std::function<void(const std::function<void()>& hold)>;
-
-  explicit LockHolder(Body body) : state_(std::make_shared<State>()) {
-    thread_ = std::thread([state = state_, body = std::move(body)] {
-      body([&state] {
+  LockHolder(std::optional<std::string> identifier, bool forWriting)
+      : state_(std::make_shared<State>()) {
+    thread_ = std::thread([state = state_, identifier, forWriting] {
+      const auto hold = [&state] {
         state->acquired.set_value();
         state->releaseFuture.wait();
-      });
+      };
+      if (identifier) {
+        KSTIdentifierLockGuard guard(*identifier, forWriting);
+        hold();
+      } else {
+        KSTAllIdentifiersLockGuard guard(forWriting);
+        hold();
+      }
     });
   }
   ~LockHolder() { release(); }
@@ -74,20 +83,6 @@ class LockHolder {
   std::thread thread_;
 };
 
-LockHolder::Body identifierLock(std::string identifier, bool forWriting) {
-  return [identifier, forWriting](const std::function<void()>& hold) {
-    KSTIdentifierLockGuard guard(identifier, forWriting);
-    hold();
-  };
-}
-
-LockHolder::Body allIdentifiersLock(bool forWriting) {
-  return [forWriting](const std::function<void()>& hold) {
-    KSTAllIdentifiersLockGuard guard(forWriting);
-    hold();
-  };
-}
-
 class LocksConcurrencyTest : public ::testing::Test {
  protected:
   // Waits until a locker has announced that it waits (its counts are raised by then).
@@ -112,12 +107,12 @@ class LocksConcurrencyTest : public ::testing::Test {
 };
 
 TEST_F(LocksConcurrencyTest, WriterWaitsForBothReadersAndTheRecordGoesWithTheLastRelease) {
-  LockHolder reader1(identifierLock("X", kKSTLockForReading));
-  LockHolder reader2(identifierLock("X", kKSTLockForReading));
+  LockHolder reader1("X", kKSTLockForReading);
+  LockHolder reader2("X", kKSTLockForReading);
   ASSERT_TRUE(reader1.waitAcquired());
   ASSERT_TRUE(reader2.waitAcquired());
 
-  LockHolder writer(identifierLock("X", kKSTLockForWriting));
+  LockHolder writer("X", kKSTLockForWriting);
   ASSERT_TRUE(waitForLine("take_one_lock", "Waiting to lock X for writing"));
   std::this_thread::sleep_for(kSettle);
   EXPECT_FALSE(writer.acquired());
@@ -143,18 +138,18 @@ TEST_F(LocksConcurrencyTest, WriterWaitsForBothReadersAndTheRecordGoesWithTheLas
 }
 
 TEST_F(LocksConcurrencyTest, WaitingAllWriterDoesNotHoldBackNewReadersButAHeldOneDoes) {
-  LockHolder reader(identifierLock("X", kKSTLockForReading));
+  LockHolder reader("X", kKSTLockForReading);
   ASSERT_TRUE(reader.waitAcquired());
 
-  LockHolder allWriter(allIdentifiersLock(kKSTLockForWriting));
+  LockHolder allWriter(kAll, kKSTLockForWriting);
   ASSERT_TRUE(waitForLine("_lock_all_identifiers", "Waiting to lock all identifiers for writing"));
   std::this_thread::sleep_for(kSettle);
   EXPECT_FALSE(allWriter.acquired());
 
   // Readers arriving while the writer of all identifiers only waits get in.
   {
-    LockHolder sameIdentifier(identifierLock("X", kKSTLockForReading));
-    LockHolder otherIdentifier(identifierLock("Y", kKSTLockForReading));
+    LockHolder sameIdentifier("X", kKSTLockForReading);
+    LockHolder otherIdentifier("Y", kKSTLockForReading);
     EXPECT_TRUE(sameIdentifier.waitAcquired());
     EXPECT_TRUE(otherIdentifier.waitAcquired());
   }
@@ -165,9 +160,9 @@ TEST_F(LocksConcurrencyTest, WaitingAllWriterDoesNotHoldBackNewReadersButAHeldOn
 
   // Once it holds the lock, identifier readers and writers and readers of all
   // identifiers wait for it.
-  LockHolder lateReader(identifierLock("Z", kKSTLockForReading));
-  LockHolder lateWriter(identifierLock("W", kKSTLockForWriting));
-  LockHolder lateAllReader(allIdentifiersLock(kKSTLockForReading));
+  LockHolder lateReader("Z", kKSTLockForReading);
+  LockHolder lateWriter("W", kKSTLockForWriting);
+  LockHolder lateAllReader(kAll, kKSTLockForReading);
   std::this_thread::sleep_for(kSettle);
   EXPECT_FALSE(lateReader.acquired());
   EXPECT_FALSE(lateWriter.acquired());
@@ -193,16 +188,16 @@ TEST_F(LocksConcurrencyTest, WaitingAllWriterDoesNotHoldBackNewReadersButAHeldOn
 }
 
 TEST_F(LocksConcurrencyTest, AllReadersShareWithIdentifierReadersButExcludeIdentifierWriters) {
-  LockHolder allReader1(allIdentifiersLock(kKSTLockForReading));
-  LockHolder allReader2(allIdentifiersLock(kKSTLockForReading));
+  LockHolder allReader1(kAll, kKSTLockForReading);
+  LockHolder allReader2(kAll, kKSTLockForReading);
   ASSERT_TRUE(allReader1.waitAcquired());
   ASSERT_TRUE(allReader2.waitAcquired());
 
-  LockHolder identifierReader(identifierLock("X", kKSTLockForReading));
+  LockHolder identifierReader("X", kKSTLockForReading);
   EXPECT_TRUE(identifierReader.waitAcquired());
 
-  LockHolder identifierWriter(identifierLock("Y", kKSTLockForWriting));
-  LockHolder allWriter(allIdentifiersLock(kKSTLockForWriting));
+  LockHolder identifierWriter("Y", kKSTLockForWriting);
+  LockHolder allWriter(kAll, kKSTLockForWriting);
   std::this_thread::sleep_for(kSettle);
   EXPECT_FALSE(identifierWriter.acquired());
   EXPECT_FALSE(allWriter.acquired());

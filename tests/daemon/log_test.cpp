@@ -44,7 +44,7 @@ TEST_F(LogTest, LevelsFilterOnlyWhileThereIsAHandle) {
 }
 
 // The real disk log: one file of 102400 bytes on a customer build, four of
-// 262144 on an internal one, rotated by size.
+// 262144 on an internal one, rotated by size; or no handle at all.
 TEST(LinuxLoggingTest, RotatingLogKeepsTheConfiguredFilesAndSizes) {
   testing::ScratchRoot scratch;
   auto logging = platform::makeLinuxLogging(scratch.root());
@@ -71,12 +71,8 @@ TEST(LinuxLoggingTest, RotatingLogKeepsTheConfiguredFilesAndSizes) {
     }
     EXPECT_EQ(files, row.count);
   }
-}
-
-TEST(LinuxLoggingTest, UnopenableLogGivesNoHandle) {
-  testing::ScratchRoot scratch;
+  // A log that cannot be opened gives no handle.
   scratch.writeFile("/blocker", "a file where a directory should be");
-  auto logging = platform::makeLinuxLogging(scratch.root());
   EXPECT_EQ(logging->open("com.zorvane.kestreld", scratch.resolve("/blocker/Logs/kestreld.log")),
             nullptr);
 }

@@ -91,6 +91,7 @@ TEST_F(RequestDispatchTest, AdmissionFollowsTheEntitlements) {
   }
 }
 
+// The refusal's log line is checked end to end.
 TEST_F(RequestDispatchTest, AdmittedClientCarriesItsIdentityAndRights) {
   connect(501, PlistDictionary{{kKSTEntitlementWipeContainer, PlistArray{"com.a", 5, "com.b"}},
                                {kKSTEntitlementOtherIdLookup, true}});
@@ -108,95 +109,52 @@ TEST_F(RequestDispatchTest, AdmittedClientCarriesItsIdentityAndRights) {
   EXPECT_TRUE(client->allowOtherIdLookup());
   EXPECT_FALSE(client->entitledWipeIdentifiers().has_value());
   EXPECT_TRUE(fakes.logging->containsMessage("No entitled containers to wipe"));
-}
 
-// The refusal's log line is checked end to end.
-TEST_F(RequestDispatchTest, RefusalsAndUnreadableIdentifiersAreLogged) {
+  // A peer without entitlements is refused silently; one whose identifier
+  // cannot be read is admitted, acting with no own identifier.
+  fakes.logging->clear();
   connect(501, std::nullopt);
-  EXPECT_EQ(admit(0), nullptr);  // "none" refuses a peer without entitlements silently
+  EXPECT_EQ(admit(0), nullptr);
   EXPECT_TRUE(fakes.logging->lines().empty());
-
   connect(501, PlistDictionary{}, std::nullopt);
-  auto client = admit(0);
-  ASSERT_NE(client, nullptr);  // admitted, acting with no own identifier
+  client = admit(0);
+  ASSERT_NE(client, nullptr);
   EXPECT_FALSE(client->clientBundleIdentifier().has_value());
   EXPECT_TRUE(
       fakes.logging->containsMessage("Failed to copy signing ID for pid 4242 : not signed"));
 }
 
-TEST_F(RequestDispatchTest, UserIdsResolveByClassAndClient) {
+// Index 27 and a refusal are checked end to end.
+TEST_F(RequestDispatchTest, RequestsThatCannotBeServedCloseTheConnectionWithoutReply) {
   struct Row {
     const char* label;
-    std::uint32_t requested;
-    KSTContainerClass containerClass;
-    std::uint32_t client;
-    std::optional<std::uint32_t> resolved;  // nullopt: refused with 38
+    std::uint64_t command;
+    bool expectReply;
+    bool internalBuild;
+    const char* logged;  // nullptr: nothing in particular
   } rows[] = {
-      {"system client, user 1 is the current mobile user", 1, 2, 0, 501},
-      {"system client, another mobile user", 502, 2, 0, 502},
-      {"system client, user 500 is no mobile user", 500, 2, 0, std::nullopt},
-      {"bundle class needs the installer", 33, 1, 0, 33},
-      {"bundle class refuses user 1", 1, 3, 0, std::nullopt},
-      {"system class needs 499", 499, 12, 501, 499},
-      {"system group class refuses 0", 0, 13, 0, std::nullopt},
-      {"class 14 is never valid", 501, 14, 0, std::nullopt},
-      {"user process names user 1", 1, 7, 501, 501},
-      {"user process names another user", 502, 2, 501, std::nullopt},
+      // The index is logged as a signed number.
+      {"huge command index", std::uint64_t{1} << 63, true, false,
+       "Invalid command index: -9223372036854775808"},
+      {"replace, not served by this build yet", 2, true, false, "Command 2 is not available"},
+      {"no reply context", 25, false, false, "Dictionary does not have reply context"},
+      // The customer build's answer is checked end to end.
+      {"retry test on an internal build", 25, true, true, nullptr},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.label);
-    std::uint32_t resolved = 77;
-    std::uint64_t code = kKSTSuccess;
-    const bool ok = validateUserId(row.requested, row.containerClass, row.client, &resolved, &code);
-    EXPECT_EQ(ok, row.resolved.has_value());
-    if (row.resolved) {
-      EXPECT_EQ(resolved, *row.resolved);
-      EXPECT_EQ(code, kKSTSuccess);
-    } else {
-      EXPECT_EQ(resolved, 77u);
-      EXPECT_EQ(code, kKSTErrorInvalidParameter);
+    fakes.deviceInfo->setInternalBuild(row.internalBuild);
+    connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
+    auto message = request(row.command);
+    message.setUint64("UserID", 501);
+    if (row.internalBuild) message.setUint64("NumRetryCrashes", 3);
+    connection->deliver(message, row.expectReply);
+    EXPECT_TRUE(connection->cancelled());
+    EXPECT_TRUE(connection->replies().empty());
+    if (row.logged != nullptr) {
+      EXPECT_TRUE(fakes.logging->containsMessage(row.logged));
     }
   }
-  EXPECT_TRUE(
-      fakes.logging->contains("validateUserId", "Invalid userId 502 for class 2 from client 501"));
-  fakes.logging->clear();
-  EXPECT_FALSE(validateUserId(502, 2, 501, nullptr, nullptr));
-  EXPECT_TRUE(fakes.logging->lines().empty());  // no code pointer: no log line
-}
-
-// Index 27 is checked end to end; the index is logged as a signed number.
-TEST_F(RequestDispatchTest, HugeCommandIndexClosesTheConnectionWithoutReply) {
-  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
-  connection->deliver(request(std::uint64_t{1} << 63));
-  EXPECT_TRUE(connection->cancelled());
-  EXPECT_TRUE(connection->replies().empty());
-  EXPECT_TRUE(fakes.logging->containsMessage("Invalid command index: -9223372036854775808"));
-}
-
-TEST_F(RequestDispatchTest, CommandsNotYetServedAndRequestsWithoutReplyContextAreRefused) {
-  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
-  connection->deliver(request(2));  // replace: not served by this build yet
-  EXPECT_TRUE(connection->cancelled());
-  EXPECT_TRUE(fakes.logging->containsMessage("Command 2 is not available"));
-
-  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
-  auto message = request(25);
-  message.setUint64("UserID", 501);
-  connection->deliver(message, /*expectReply=*/false);
-  EXPECT_TRUE(connection->cancelled());
-  EXPECT_TRUE(fakes.logging->containsMessage("Dictionary does not have reply context"));
-}
-
-// The customer build's answer is checked end to end.
-TEST_F(RequestDispatchTest, RetryTestOnAnInternalBuildClosesTheConnection) {
-  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
-  auto message = request(25);
-  message.setUint64("UserID", 501);
-  message.setUint64("NumRetryCrashes", 3);
-  fakes.deviceInfo->setInternalBuild(true);
-  connection->deliver(message);
-  EXPECT_TRUE(connection->cancelled());
-  EXPECT_TRUE(connection->replies().empty());
 }
 
 TEST_F(RequestDispatchTest, AClientsOwnEntitlementsAreRegisteredOnItsFirstRequest) {

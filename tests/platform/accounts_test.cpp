@@ -13,7 +13,7 @@ namespace {
 
 using testing::ScratchRoot;
 
-TEST(AccountsTest, UsersOfAScratchRootComeFromItsPasswdWithHomesBeneathIt) {
+TEST(AccountsTest, AScratchRootsAccountsComeFromItsOwnFilesOnly) {
   ScratchRoot scratch;
   LinuxAccounts accounts(scratch.root());
   struct Row {
@@ -41,21 +41,8 @@ TEST(AccountsTest, UsersOfAScratchRootComeFromItsPasswdWithHomesBeneathIt) {
   ASSERT_TRUE(accounts.groupByName("systemusers").has_value());
   EXPECT_EQ(accounts.groupByName("systemusers")->gid, 499U);
   EXPECT_EQ(accounts.groupById(499)->name, "systemusers");
-}
 
-TEST(AccountsTest, AScratchRootWithoutAccountFilesNeverFallsBackToTheHost) {
-  ScratchRoot scratch;
-  std::filesystem::remove(scratch.resolve("/etc/passwd"));
-  std::filesystem::remove(scratch.resolve("/etc/group"));
-  LinuxAccounts accounts(scratch.root());
-  EXPECT_FALSE(accounts.userByName("root").has_value());
-  EXPECT_FALSE(accounts.userById(0).has_value());
-  EXPECT_FALSE(accounts.groupByName("root").has_value());
-  EXPECT_FALSE(accounts.groupById(0).has_value());
-}
-
-TEST(AccountsTest, MalformedLinesAreSkippedFirstMatchWinsAndLongEntriesAreRead) {
-  ScratchRoot scratch;
+  // Malformed lines are skipped, the first match wins and long entries are read.
   std::string members;
   for (int i = 0; i < 500; ++i) members += (i ? ",member" : "member") + std::to_string(i);
   scratch.writeFile("/etc/passwd",
@@ -64,7 +51,6 @@ TEST(AccountsTest, MalformedLinesAreSkippedFirstMatchWinsAndLongEntriesAreRead) 
                     "second:x:600:600::/home/second:/bin/sh\n"
                     "homeless:x:601:601:::/bin/sh\n");
   scratch.writeFile("/etc/group", "crowd:x:700:" + members + "\nafter:x:701:\n");
-  LinuxAccounts accounts(scratch.root());
 
   ASSERT_TRUE(accounts.userById(600).has_value());
   EXPECT_EQ(accounts.userById(600)->name, "first");
@@ -77,6 +63,14 @@ TEST(AccountsTest, MalformedLinesAreSkippedFirstMatchWinsAndLongEntriesAreRead) 
   EXPECT_EQ(accounts.groupByName("crowd")->gid, 700U);
   ASSERT_TRUE(accounts.groupById(701).has_value());
   EXPECT_EQ(accounts.groupById(701)->name, "after");
+
+  // Without account files a scratch root never falls back to the host's.
+  std::filesystem::remove(scratch.resolve("/etc/passwd"));
+  std::filesystem::remove(scratch.resolve("/etc/group"));
+  EXPECT_FALSE(accounts.userByName("root").has_value());
+  EXPECT_FALSE(accounts.userById(0).has_value());
+  EXPECT_FALSE(accounts.groupByName("root").has_value());
+  EXPECT_FALSE(accounts.groupById(0).has_value());
 }
 
 TEST(AccountsTest, TheHostRootUsesTheHostDatabase) {

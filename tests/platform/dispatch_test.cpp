@@ -308,10 +308,8 @@ TEST(DispatchTest, MainQueueRunsOnTheLoopThreadAndKeepsItemsBetweenRuns) {
   });
   EXPECT_EQ(runMainLoop(), 5);
   EXPECT_EQ(ran, (std::vector<int>{1, 2, 3}));
-}
 
-TEST(DispatchTest, TerminationSignalsReachTheHandlerOnTheMainQueue) {
-  auto loopThread = std::this_thread::get_id();
+  // Termination signals reach their handler on the main queue.
   auto watch = watchTerminationSignals([&](int signal) {
     EXPECT_EQ(std::this_thread::get_id(), loopThread);
     stopMainLoop(signal);

@@ -21,6 +21,7 @@ TEST(FormatTest, RendersEachPlaceholderLikeTheSystemDoes) {
   };
   const std::uint32_t uid = 501;
   const std::uint64_t big = 18446744073709551615ULL;
+  const std::string long1(1000, 'x');
   const Row rows[] = {
       {"plain text", formatMessage("no placeholders"), "no placeholders"},
       {"%d", formatMessage("%d: %@", 42, "msg"), "42: msg"},
@@ -38,23 +39,20 @@ TEST(FormatTest, RendersEachPlaceholderLikeTheSystemDoes) {
       {"%@ of absent object", formatMessage("%@", nullptr), "(null)"},
       {"%@ of optional", formatMessage("%@", std::optional<std::string>()), "(null)"},
       {"%@ of object", formatMessage("%@", Described{}), "<described>"},
-      {"%@ of plist array", formatMessage("%@", PlistValue(PlistArray{"a", 1})), "(\n    a,\n    1\n)"},
+      {"%@ of plist array", formatMessage("%@", PlistValue(PlistArray{"a", 1})),
+       "(\n    a,\n    1\n)"},
       {"%%", formatMessage("100%% done"), "100% done"},
       {"width", formatMessage("[%5d]", 42), "[   42]"},
       {"missing argument", formatMessage("%@ and %@", "one"), "one and (null)"},
       {"dangling percent", formatMessage("50%"), "50%"},
       {"quoted %@", formatMessage("Container with identifier: \"%@\" Not Found", "x"),
        "Container with identifier: \"x\" Not Found"},
+      {"long output is not truncated", formatMessage("%s-%s", long1, long1), long1 + "-" + long1},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.label);
     EXPECT_EQ(row.actual, row.expected);
   }
-}
-
-TEST(FormatTest, LongOutputIsNotTruncated) {
-  const std::string long1(1000, 'x');
-  EXPECT_EQ(formatMessage("%s-%s", long1, long1), long1 + "-" + long1);
 }
 
 }  // namespace

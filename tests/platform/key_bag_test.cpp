@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <chrono>
 #include <condition_variable>
 #include <mutex>
@@ -40,52 +41,37 @@ TEST(KeyBagTest, LockStateIsParsedFromTheLockStateFile) {
   }
 }
 
-// Records what the handler saw, each time it runs.
-struct Observations {
+TEST(KeyBagTest, WritingTheLockStateRunsTheHandlerOnTheGivenQueue) {
+  ScratchRoot scratch;
+  const auto queue = DispatchQueue::createSerial("key-bag-test");
+  // What the handler saw, each time it ran; outlives the key bag, whose handler writes it.
   std::mutex mutex;
   std::condition_variable changed;
   std::vector<int> states;
   bool allOnQueue = true;
-
-  bool waitFor(int state, std::size_t from) {
-    std::unique_lock lock(mutex);
-    return changed.wait_for(lock, 10s, [&] {
-      for (std::size_t i = from; i < states.size(); ++i) {
-        if (states[i] == state) return true;
-      }
-      return false;
-    });
-  }
-  std::size_t count() {
-    std::lock_guard lock(mutex);
-    return states.size();
-  }
-};
-
-TEST(KeyBagTest, WritingTheLockStateRunsTheHandlerOnTheGivenQueue) {
-  ScratchRoot scratch;
-  const auto queue = DispatchQueue::createSerial("key-bag-test");
-  ASSERT_NE(queue, nullptr);
-  Observations seen;  // outlives the key bag, whose handler writes to it
   LinuxKeyBag keyBag(scratch.root());
-  ASSERT_EQ(keyBag.registerLockStatusNotification(queue,
-                                                  [&] {
-                                                    const int state = keyBag.lockState();
-                                                    std::lock_guard lock(seen.mutex);
-                                                    seen.allOnQueue &= queue->isCurrent();
-                                                    seen.states.push_back(state);
-                                                    seen.changed.notify_all();
-                                                  }),
-            0);
+  const auto handler = [&] {
+    const int state = keyBag.lockState();
+    std::lock_guard lock(mutex);
+    allOnQueue &= queue->isCurrent();
+    states.push_back(state);
+    changed.notify_all();
+  };
+  ASSERT_EQ(keyBag.registerLockStatusNotification(queue, handler), 0);
 
-  scratch.writeFile(kLockState, "1");
-  ASSERT_TRUE(seen.waitFor(KeyBag::kLocked, 0));
-  const std::size_t afterLock = seen.count();
-  scratch.writeFile(kLockState, "0");
-  ASSERT_TRUE(seen.waitFor(KeyBag::kUnlocked, afterLock));
+  std::size_t from = 0;
+  for (const int state : {KeyBag::kLocked, KeyBag::kUnlocked}) {
+    SCOPED_TRACE(state);
+    scratch.writeFile(kLockState, std::to_string(state));
+    std::unique_lock lock(mutex);
+    ASSERT_TRUE(changed.wait_for(lock, 10s, [&] {
+      return std::find(states.begin() + from, states.end(), state) != states.end();
+    }));
+    from = states.size();
+  }
   queue->sync([] {});
-  std::lock_guard lock(seen.mutex);
-  EXPECT_TRUE(seen.allOnQueue);
+  std::lock_guard lock(mutex);
+  EXPECT_TRUE(allOnQueue);
 }
 
 TEST(KeyBagTest, RegistrationFailsWithAnErrnoWhenTheStateDirectoryCannotBeMade) {

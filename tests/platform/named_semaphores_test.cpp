@@ -2,6 +2,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <memory>
 #include <regex>
 #include <string>
 
@@ -12,20 +13,6 @@ namespace kestrel::platform {
 namespace {
 
 using testing::ScratchRoot;
-
-// Unlinks the semaphore when the test ends, however it ends.
-class RemoveOnExit {
- public:
-  RemoveOnExit(NamedSemaphores& semaphores, std::string name)
-      : semaphores_(semaphores), name_(std::move(name)) {}
-  ~RemoveOnExit() { semaphores_.remove(name_); }
-  RemoveOnExit(const RemoveOnExit&) = delete;
-  RemoveOnExit& operator=(const RemoveOnExit&) = delete;
-
- private:
-  NamedSemaphores& semaphores_;
-  std::string name_;
-};
 
 TEST(NamedSemaphoresTest, NamesAreScopedToTheRoot) {
   EXPECT_EQ(scopedSemaphoreName(FilesystemRoot("/"), "/kestreld.fb_check"), "/kestreld.fb_check");
@@ -43,8 +30,11 @@ TEST(NamedSemaphoresTest, AMarkLivesUntilRemovedAndOnlyBeneathItsOwnRoot) {
   LinuxNamedSemaphores mine(first.root());
   LinuxNamedSemaphores theirs(second.root());
   const std::string name = "kestreld.test." + std::to_string(::getpid());
-  RemoveOnExit cleanupMine(mine, name);
-  RemoveOnExit cleanupTheirs(theirs, name);
+  // Unlinks the marks when the test ends, however it ends.
+  const std::shared_ptr<void> cleanup(nullptr, [&](void*) {
+    mine.remove(name);
+    theirs.remove(name);
+  });
 
   EXPECT_FALSE(mine.openExisting(name));
   ASSERT_EQ(mine.create(name, 0644, 1), 0);
@@ -56,13 +46,10 @@ TEST(NamedSemaphoresTest, AMarkLivesUntilRemovedAndOnlyBeneathItsOwnRoot) {
   mine.remove(name);
   EXPECT_FALSE(mine.openExisting(name));
   mine.remove(name);  // removing again is harmless
-}
 
-TEST(NamedSemaphoresTest, CreateReportsTheErrnoOfAFailure) {
-  ScratchRoot scratch;
-  LinuxNamedSemaphores semaphores(scratch.root());
-  EXPECT_EQ(semaphores.create("not/a/name", 0644, 1), EINVAL);
-  EXPECT_FALSE(semaphores.openExisting("not/a/name"));
+  // A failure reports its errno.
+  EXPECT_EQ(mine.create("not/a/name", 0644, 1), EINVAL);
+  EXPECT_FALSE(mine.openExisting("not/a/name"));
 }
 
 }  // namespace

@@ -59,7 +59,9 @@ DaemonProcess::DaemonProcess(const std::string& root) {
   }
 }
 
-DaemonProcess::~DaemonProcess() { stop(); }
+DaemonProcess::~DaemonProcess() {
+  stop();
+}
 
 int DaemonProcess::stop() {
   if (pid_ <= 0) return -1;
@@ -84,8 +86,8 @@ ProcessResult runProcess(const std::string& program, const std::vector<std::stri
   std::vector<std::string> env = environmentWith(extraEnvironment);
   auto argv = pointers(args);
   auto envp = pointers(env);
-  pid_t pid = -1;
-  const int spawned = posix_spawn(&pid, program.c_str(), &actions, nullptr, argv.data(), envp.data());
+  const int spawned =
+      posix_spawn(&result.pid, program.c_str(), &actions, nullptr, argv.data(), envp.data());
   posix_spawn_file_actions_destroy(&actions);
   ::close(fds[1]);
   if (spawned == 0) {
@@ -93,7 +95,7 @@ ProcessResult runProcess(const std::string& program, const std::vector<std::stri
     ssize_t n;
     while ((n = ::read(fds[0], buffer, sizeof buffer)) > 0) result.output.append(buffer, size_t(n));
     int status = 0;
-    ::waitpid(pid, &status, 0);
+    ::waitpid(result.pid, &status, 0);
     result.exitStatus = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
   }
   ::close(fds[0]);

@@ -30,6 +30,7 @@ class DaemonProcess {
 struct ProcessResult {
   int exitStatus = -1;
   std::string output;  // standard output and error together
+  pid_t pid = -1;      // the process it ran as
 };
 
 // Runs the program with the arguments and environment entries added to this process's.

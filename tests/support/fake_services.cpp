@@ -17,18 +17,8 @@ FakeServices::FakeServices()
       sandbox(std::make_shared<platform::FakeSandbox>()),
       codeSigningIdentity(std::make_shared<platform::FakeCodeSigningIdentity>()),
       extendedACL(std::make_shared<platform::FakeExtendedACL>(accounts)) {
-  services.root = scratch.root();
-  services.accounts = accounts;
-  services.logging = logging;
-  services.deviceInfo = deviceInfo;
-  services.keepAlive = keepAlive;
-  services.semaphores = semaphores;
-  services.keyBag = keyBag;
-  services.upcall = upcall;
-  services.messageIPC = messageIPC;
-  services.sandbox = sandbox;
-  services.codeSigningIdentity = codeSigningIdentity;
-  services.extendedACL = extendedACL;
+  services = {scratch.root(), accounts, logging,    deviceInfo, keepAlive,           semaphores,
+              keyBag,         upcall,   messageIPC, sandbox,    codeSigningIdentity, extendedACL};
   install();
 }
 
@@ -59,21 +49,11 @@ std::size_t FakeServices::countLogged(std::string_view text, Match match,
   std::size_t count = 0;
   for (const auto& line : logging->lines()) {
     if (!tag.empty() && line.tag != tag) continue;
-    const std::string_view message = line.message;
-    switch (match) {
-      case Match::Exact:
-        count += message == text;
-        break;
-      case Match::Contains:
-        count += message.find(text) != std::string_view::npos;
-        break;
-      case Match::Prefix:
-        count += message.starts_with(text);
-        break;
-      case Match::Suffix:
-        count += message.ends_with(text);
-        break;
-    }
+    const std::string_view m = line.message;
+    count += match == Match::Exact      ? m == text
+             : match == Match::Contains ? m.find(text) != std::string_view::npos
+             : match == Match::Prefix   ? m.starts_with(text)
+                                        : m.ends_with(text);
   }
   return count;
 }

@@ -28,18 +28,12 @@ void RegisteredClientsTest::registerClient(const std::string& name, const std::s
   fs::copy_file(KESTRELCTL_BINARY, binary, fs::copy_options::overwrite_existing);
   fs::permissions(binary, fs::perms(0755));
   const std::string plist = "/etc/kestrel/signatures/" + name + ".plist";
-  scratch.writeFile(plist,
-                    "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>"
-                    "<key>SigningIdentifier</key><string>" +
-                        identifier +
-                        "</string>"
-                        "<key>Executable</key><string>" +
-                        binary +
-                        "</string>"
-                        "<key>Entitlements</key><dict>" +
-                        entitlements +
-                        "</dict>"
-                        "</dict></plist>\n");
+  const std::string body = "<key>SigningIdentifier</key><string>" + identifier +
+                           "</string><key>Executable</key><string>" + binary +
+                           "</string><key>Entitlements</key><dict>" + entitlements + "</dict>";
+  scratch.writeFile(
+      plist, "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>" + body +
+                 "</dict></plist>\n");
   fs::permissions(scratch.resolve(plist), fs::perms(0644));
 }
 

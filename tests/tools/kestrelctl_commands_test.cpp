@@ -1,14 +1,17 @@
-// kestrelctl's named subcommands: option parsing and the requests they send.
+// kestrelctl's named subcommands and request items: option parsing and the
+// requests they send.
 #include "kestrelctl/commands.h"
 
 #include <gtest/gtest.h>
 
+#include "kestrelctl/request_items.h"
 #include "store/container_class.h"
 
 namespace kestrel::kestrelctl {
 namespace {
 
-TEST(KestrelctlCommandsTest, ClassNamesMatchTheDaemonsClassPaths) {
+TEST(KestrelctlCommandsTest, ParsesClassesAndUserIds) {
+  // Every class by the daemon's own name for it.
   ASSERT_EQ(containerClassNames().size(), 13u);
   for (std::uint64_t c = 1; c <= 13; ++c) {
     SCOPED_TRACE(c);
@@ -16,9 +19,6 @@ TEST(KestrelctlCommandsTest, ClassNamesMatchTheDaemonsClassPaths) {
     std::string error;
     EXPECT_EQ(parseContainerClass(KSTContainerClassPath(c), &error), c) << error;
   }
-}
-
-TEST(KestrelctlCommandsTest, ParsesClassesAndUserIds) {
   struct Row {
     const char* text;
     std::optional<std::uint64_t> containerClass;
@@ -61,35 +61,27 @@ TEST(KestrelctlCommandsTest, ParsesClassesAndUserIds) {
 std::string describe(const platform::MessageDictionary& request) {
   std::string out;
   for (const auto& [key, value] : request.entries()) {
-    out += out.empty() ? "" : " ";
-    out += key + "=";
+    out += (out.empty() ? "" : " ") + key + "=";
     if (auto u = value.uint64()) {
       out += "u64:" + std::to_string(*u);
     } else if (auto b = value.boolean()) {
       out += std::string("bool:") + (*b ? "true" : "false");
-    } else if (const std::string* s = value.string()) {
-      out += "str:" + *s;
     } else {
-      out += "?";
+      out += value.string() ? "str:" + *value.string() : "?";
     }
   }
   return out;
 }
 
-TEST(KestrelctlCommandsTest, BuildsTheRequestOfEachSubcommand) {
-  RequestOptions full;
-  full.containerClass = 2;
-  full.userId = 501;
-  full.identifier = "com.example.app";
-  full.transient = true;
-  RequestOptions noIdentifier = full;
-  noIdentifier.identifier.reset();
-  noIdentifier.transient = false;
-
+TEST(KestrelctlCommandsTest, BuildsTheRequestOfEachSubcommandOrSaysWhatIsMissing) {
+  RequestOptions full{2, 501, "com.example.app", true};
+  RequestOptions noIdentifier{2, 501, std::nullopt, false};
+  RequestOptions noClass{std::nullopt, 501, std::nullopt, false};
+  RequestOptions noUser{2, std::nullopt, std::nullopt, false};
   struct Row {
     Subcommand subcommand;
     const RequestOptions& options;
-    const char* request;
+    const char* request;  // or "error: " and the message
   };
   const Row rows[] = {
       {Subcommand::Create, full,
@@ -108,39 +100,34 @@ TEST(KestrelctlCommandsTest, BuildsTheRequestOfEachSubcommand) {
       {Subcommand::SystemContainer, noIdentifier, "Command=u64:15"},
       {Subcommand::CodeSigningInfo, full, "Command=u64:19 Identifier=str:com.example.app"},
       {Subcommand::InvalidateCodeSigning, full, "Command=u64:20"},
+      {Subcommand::Create, noClass, "error: --class is required"},
+      {Subcommand::Lookup, noUser, "error: --user is required"},
+      {Subcommand::List, noClass, "error: --class is required"},
+      {Subcommand::CodeSigningInfo, noClass, "error: --identifier is required"},
   };
   for (const Row& row : rows) {
     const SubcommandInfo& info = subcommandInfo(row.subcommand);
     SCOPED_TRACE(std::string(info.name) + " " + row.request);
     platform::MessageDictionary request;
     std::string error;
-    ASSERT_TRUE(buildRequest(info, row.options, &request, &error)) << error;
-    EXPECT_EQ(describe(request), row.request);
+    const bool built = buildRequest(info, row.options, &request, &error);
+    EXPECT_EQ(built ? describe(request) : "error: " + error, row.request);
   }
 }
 
-TEST(KestrelctlCommandsTest, MissingRequiredOptionsAreRefused) {
-  RequestOptions noClass;
-  noClass.userId = 501;
-  RequestOptions noUser;
-  noUser.containerClass = 2;
-  struct Row {
-    Subcommand subcommand;
-    const RequestOptions& options;
-    const char* error;
+// An operator's JSON argument can be of any depth; a deep one is refused with
+// a message, never taken down with the stack.
+TEST(KestrelctlRequestItemsTest, DeeplyNestedJsonIsRefused) {
+  const auto nestedArrays = [](std::size_t levels) {
+    return std::string(levels, '[') + std::string(levels, ']');
   };
-  const Row rows[] = {
-      {Subcommand::Create, noClass, "--class is required"},
-      {Subcommand::Lookup, noUser, "--user is required"},
-      {Subcommand::List, noClass, "--class is required"},
-      {Subcommand::CodeSigningInfo, noClass, "--identifier is required"},
-  };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.error);
-    platform::MessageDictionary request;
-    std::string error;
-    EXPECT_FALSE(buildRequest(subcommandInfo(row.subcommand), row.options, &request, &error));
-    EXPECT_EQ(error, row.error);
+  std::string error;
+  EXPECT_TRUE(plistFromJson(nestedArrays(256), &error)) << error;
+  for (std::size_t levels : {257, 200000}) {
+    SCOPED_TRACE(levels);
+    error.clear();
+    EXPECT_FALSE(plistFromJson(nestedArrays(levels), &error));
+    EXPECT_EQ(error, "nested deeper than 256 levels");
   }
 }
 

@@ -14,7 +14,11 @@ using platform::Uuid;
 const Uuid kFirst = *Uuid::parse("1b4e28ba-2fa1-11d2-883f-0016d3cca427");
 const Uuid kSecond = *Uuid::parse("6D3F0A52-0C4B-4F0E-9C1E-2B7A4E5D6C7F");
 
-TEST(KestrelctlHumanOutputTest, CreateReplyIsOneLinePerFact) {
+MessageValue text(const char* s) {
+  return MessageValue::fromString(s);
+}
+
+TEST(KestrelctlHumanOutputTest, CreateAndInfoRepliesAreOneLinePerFact) {
   MessageDictionary reply;
   reply.setUint64("ReplyError", 1);
   reply.setString("ReplyIdentifier", "com.example.app");
@@ -36,6 +40,25 @@ TEST(KestrelctlHumanOutputTest, CreateReplyIsOneLinePerFact) {
             "path        -\n"
             "uuid        -\n"
             "existed     yes\n");
+
+  // Code-signing information shows nested values indented.
+  MessageDictionary entitlements;
+  entitlements.setBoolean("com.example.allowed", true);
+  MessageDictionary info;
+  info.setString("SigningIdentifier", "com.example.app");
+  info.setArray("Groups", {text("group.a"), text("group.b")});
+  info.setDictionary("Entitlements", std::move(entitlements));
+  info.setUint64("Team", 7);
+  MessageDictionary infoReply;
+  infoReply.setDictionary("ReplyInfoDictionary", std::move(info));
+  EXPECT_EQ(renderReply(Subcommand::CodeSigningInfo, infoReply),
+            "Entitlements\n"
+            "  com.example.allowed  true\n"
+            "Groups\n"
+            "  - group.a\n"
+            "  - group.b\n"
+            "SigningIdentifier  com.example.app\n"
+            "Team               7\n");
 }
 
 TEST(KestrelctlHumanOutputTest, ListReplyIsATableWithACount) {
@@ -53,22 +76,20 @@ TEST(KestrelctlHumanOutputTest, ListReplyIsATableWithACount) {
   };
   const Row rows[] = {
       {"two",
-       listReply({MessageValue::fromString("com.example.app"),
-                  MessageValue::fromString("com.example.longer-name")},
+       listReply({text("com.example.app"), text("com.example.longer-name")},
                  {MessageValue::fromUuid(kFirst), MessageValue::fromUuid(kSecond)}),
        "IDENTIFIER               UUID\n"
        "com.example.app          1B4E28BA-2FA1-11D2-883F-0016D3CCA427\n"
        "com.example.longer-name  6D3F0A52-0C4B-4F0E-9C1E-2B7A4E5D6C7F\n"
        "2 containers\n"},
-      {"one", listReply({MessageValue::fromString("a")}, {MessageValue::fromUuid(kFirst)}),
+      {"one", listReply({text("a")}, {MessageValue::fromUuid(kFirst)}),
        "IDENTIFIER  UUID\n"
        "a           1B4E28BA-2FA1-11D2-883F-0016D3CCA427\n"
        "1 container\n"},
       {"empty", listReply({}, {}), "0 containers\n"},
       {"no arrays", MessageDictionary(), "0 containers\n"},
       {"uneven",
-       listReply({MessageValue::fromString("a"), MessageValue::fromUint64(7)},
-                 {MessageValue::fromUuid(kFirst)}),
+       listReply({text("a"), MessageValue::fromUint64(7)}, {MessageValue::fromUuid(kFirst)}),
        "IDENTIFIER  UUID\n"
        "a           1B4E28BA-2FA1-11D2-883F-0016D3CCA427\n"
        "-           -\n"
@@ -78,27 +99,6 @@ TEST(KestrelctlHumanOutputTest, ListReplyIsATableWithACount) {
     SCOPED_TRACE(row.name);
     EXPECT_EQ(renderReply(Subcommand::List, row.reply), row.text);
   }
-}
-
-TEST(KestrelctlHumanOutputTest, CodeSigningInfoShowsNestedValuesIndented) {
-  MessageDictionary entitlements;
-  entitlements.setBoolean("com.example.allowed", true);
-  MessageDictionary info;
-  info.setString("SigningIdentifier", "com.example.app");
-  info.setArray("Groups",
-                {MessageValue::fromString("group.a"), MessageValue::fromString("group.b")});
-  info.setDictionary("Entitlements", std::move(entitlements));
-  info.setUint64("Team", 7);
-  MessageDictionary reply;
-  reply.setDictionary("ReplyInfoDictionary", std::move(info));
-  EXPECT_EQ(renderReply(Subcommand::CodeSigningInfo, reply),
-            "Entitlements\n"
-            "  com.example.allowed  true\n"
-            "Groups\n"
-            "  - group.a\n"
-            "  - group.b\n"
-            "SigningIdentifier  com.example.app\n"
-            "Team               7\n");
 }
 
 TEST(KestrelctlHumanOutputTest, FailuresNameWellKnownCodes) {

@@ -15,7 +15,8 @@
 namespace kestrel {
 namespace {
 
-std::vector<std::uint8_t> requestHeader(std::uint32_t bits, std::uint32_t replyPort, std::uint32_t id) {
+std::vector<std::uint8_t> requestHeader(std::uint32_t bits, std::uint32_t replyPort,
+                                        std::uint32_t id) {
   std::vector<std::uint8_t> message(52, 0);
   auto put = [&](std::size_t offset, std::uint32_t value) {
     for (std::size_t i = 0; i < 4; ++i) message[offset + i] = std::uint8_t(value >> (8 * i));
