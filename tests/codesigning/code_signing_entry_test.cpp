@@ -12,7 +12,7 @@ PlistDictionary sampleInfo() {
       {"Other", 7}};
 }
 
-TEST(CodeSigningEntryTest, SerializedFormRoundTripsAndLeavesAbsentValuesOut) {
+TEST(CodeSigningEntryTest, SerializedFormRoundTripsLeavesAbsentValuesOutAndHashesByValue) {
   KSTCodeSigningEntry empty;
   const PlistDictionary emptyForm = empty.serialize();
   EXPECT_EQ(emptyForm.count("CodeSigningInfo"), 0u);
@@ -29,6 +29,12 @@ TEST(CodeSigningEntryTest, SerializedFormRoundTripsAndLeavesAbsentValuesOut) {
   EXPECT_EQ(back, full);
   EXPECT_EQ(back.hash(), full.hash());
   EXPECT_EQ(KSTCodeSigningEntry::initWithSerializedDictionary(emptyForm), empty);
+
+  // Equal information hashes equal, whatever the signedness of its integers.
+  const KSTCodeSigningEntry signedInfo(PlistDictionary{{"n", std::int64_t{5}}}, 0);
+  const KSTCodeSigningEntry unsignedInfo(PlistDictionary{{"n", std::uint64_t{5}}}, 0);
+  EXPECT_EQ(signedInfo, unsignedInfo);
+  EXPECT_EQ(signedInfo.hash(), unsignedInfo.hash());
 }
 
 TEST(CodeSigningEntryTest, ValuesOfTheWrongTypeReadAsMissing) {
@@ -52,11 +58,7 @@ TEST(CodeSigningEntryTest, ValuesOfTheWrongTypeReadAsMissing) {
 
 TEST(CodeSigningEntryTest, EqualityComparesEveryField) {
   const KSTCodeSigningEntry base(sampleInfo(), 2);
-  struct Row {
-    const char* label;
-    void (*change)(KSTCodeSigningEntry&);
-  };
-  const Row rows[] = {
+  const std::pair<const char*, void (*)(KSTCodeSigningEntry&)> rows[] = {
       {"info absent", [](KSTCodeSigningEntry& e) { e.setCodeSigningInfo(std::nullopt); }},
       {"info differs", [](KSTCodeSigningEntry& e) { e.setCodeSigningInfo(PlistDictionary{}); }},
       {"children present",
@@ -66,10 +68,10 @@ TEST(CodeSigningEntryTest, EqualityComparesEveryField) {
       {"registered by caller", [](KSTCodeSigningEntry& e) { e.setRegisteredByCaller(true); }},
       {"class", [](KSTCodeSigningEntry& e) { e.setDataContainerClass(4); }},
   };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.label);
+  for (const auto& [label, change] : rows) {
+    SCOPED_TRACE(label);
     KSTCodeSigningEntry changed = base;
-    row.change(changed);
+    change(changed);
     EXPECT_FALSE(changed.isEqual(base));
     EXPECT_FALSE(base.isEqual(changed));
   }
@@ -78,13 +80,6 @@ TEST(CodeSigningEntryTest, EqualityComparesEveryField) {
   reordered.setChildBundleIdentifiers(std::vector<std::string>{"b", "a"});
   EXPECT_NE(ordered, reordered);
   EXPECT_EQ(base, KSTCodeSigningEntry(sampleInfo(), 2));
-}
-
-TEST(CodeSigningEntryTest, EqualInformationHashesEqualWhateverTheIntegersSignedness) {
-  const KSTCodeSigningEntry signedInfo(PlistDictionary{{"n", std::int64_t{5}}}, 0);
-  const KSTCodeSigningEntry unsignedInfo(PlistDictionary{{"n", std::uint64_t{5}}}, 0);
-  EXPECT_EQ(signedInfo, unsignedInfo);
-  EXPECT_EQ(signedInfo.hash(), unsignedInfo.hash());
 }
 
 }  // namespace

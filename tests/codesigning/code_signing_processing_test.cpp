@@ -5,49 +5,26 @@
 
 #include <chrono>
 #include <filesystem>
-#include <fstream>
-#include <functional>
 #include <future>
 #include <thread>
-#include <utility>
 
 #include "codesigning/code_signing_mapping.h"
-#include "daemon/client_connection.h"
 #include "daemon/command_handlers.h"
 #include "daemon/error_codes.h"
 #include "daemon/locks.h"
-#include "platform/sandbox.h"
-#include "store/container_cache.h"
-#include "support/fake_services.h"
+#include "support/store_test_helpers.h"
 
 namespace kestrel {
 namespace {
 
 namespace fs = std::filesystem;
+using testing::existingContainer;
+using testing::infoWithEntitlements;
+using testing::storedEntry;
 using Strings = std::vector<std::string>;
+constexpr KSTContainerClass kAppGroup = kKSTContainerClassSharedAppGroup;
 
-PlistDictionary infoWith(PlistDictionary entitlements) {
-  return PlistDictionary{{kKSTEntitlementsKey, std::move(entitlements)}, {"Opaque", "kept"}};
-}
-
-// The first removal of a sandbox mapping runs the hook.
-class HookedSandbox final : public platform::Sandbox {
- public:
-  int setUserStateItem(std::uint32_t, std::uint64_t, const std::string&,
-                       const std::optional<std::string>& path, std::uint64_t) override {
-    if (!path && hook) std::exchange(hook, nullptr)();
-    return 0;
-  }
-  std::optional<std::string> userStateItem(std::uint32_t, std::uint64_t,
-                                           const std::string&) const override {
-    return std::nullopt;
-  }
-  std::vector<platform::SandboxUserStateItem> userStateItems() const override { return {}; }
-
-  std::function<void()> hook;
-};
-
-class CodeSigningProcessingTest : public ::testing::Test {
+class CodeSigningProcessingTest : public testing::StoreTest {
  protected:
   static std::uint64_t process(std::optional<PlistDictionary> info,
                                std::optional<std::string> identifier,
@@ -55,14 +32,8 @@ class CodeSigningProcessingTest : public ::testing::Test {
     return KSTCodeSigningMapping::sharedInstance().processCodeSigningInfo(info, identifier,
                                                                           options);
   }
-  static std::optional<KSTCodeSigningEntry> entry(const std::string& identifier) {
-    return KSTCodeSigningMapping::sharedInstance().withState(
-        std::optional<KSTCodeSigningEntry>(),
-        [&](KSTCodeSigningMappingState& state) -> std::optional<KSTCodeSigningEntry> {
-          const KSTCodeSigningEntry* found = state.entryForIdentifier(identifier);
-          if (found == nullptr) return std::nullopt;
-          return *found;
-        });
+  static PlistDictionary groups(PlistValue groups) {
+    return infoWithEntitlements({{kKSTApplicationGroupsEntitlement, std::move(groups)}});
   }
   std::size_t writes() const {
     return fakes.countLogged("Wrote code signing mappings to disk after set");
@@ -74,39 +45,24 @@ class CodeSigningProcessingTest : public ::testing::Test {
     }
     return lines.size();
   }
-
-  KSTMetadataRef make(std::uint32_t user, KSTContainerClass containerClass,
-                      const std::string& identifier) {
-    std::uint64_t code = kKSTSuccess;
-    KSTMetadataRef made = installer.createOrLookupContainerForUser(
-        user, identifier, true, containerClass, false, true, &code);
-    EXPECT_TRUE(made) << code;
-    return made;
-  }
-  static bool exists(std::uint32_t user, KSTContainerClass containerClass,
-                     const std::string& identifier) {
-    KSTErrorRef error;
-    const KSTMetadataRef found = KSTContainerCache::sharedInstance().containerForUser(
-        user, containerClass, identifier, false, &error);
-    return found && fs::exists(found->url().path());
-  }
-
-  testing::FakeServices fakes;
-  KSTClientConnection installer{std::string("com.example.installer"), 0, true, std::nullopt};
 };
 
 TEST_F(CodeSigningProcessingTest, SameInformationTwiceWritesNothingTheSecondTime) {
-  const PlistDictionary info = infoWith(
+  EXPECT_EQ(process(std::nullopt, "com.example.unknown"), kKSTSuccess);
+  EXPECT_EQ(process(infoWithEntitlements({}), std::nullopt), kKSTErrorMissingIdentifier);
+  EXPECT_EQ(firstLineStartingWith("Staging Code Signing Mapping"), fakes.logging->lines().size());
+  EXPECT_EQ(writes(), 0u);
+
+  const PlistDictionary info = infoWithEntitlements(
       {{kKSTApplicationGroupsEntitlement, "group.a"}, {kKSTSystemContainerEntitlement, true}});
   const PlistDictionary options{{kKSTDataContainerClassOption, std::uint64_t{2}},
                                 {kKSTPlaceholderEntitlementsOption, true}};
   ASSERT_EQ(process(info, "com.example.app", options), kKSTSuccess);
   ASSERT_EQ(writes(), 1u);
-  const auto stored = entry("com.example.app");
+  const auto stored = storedEntry("com.example.app");
   ASSERT_TRUE(stored);
   EXPECT_EQ(stored->dataContainerClass(), 2u);
   EXPECT_TRUE(stored->placeholder());
-
   EXPECT_EQ(process(info, "com.example.app", options), kKSTSuccess);
   EXPECT_EQ(writes(), 1u);
   // Another option is a change.
@@ -116,24 +72,22 @@ TEST_F(CodeSigningProcessingTest, SameInformationTwiceWritesNothingTheSecondTime
 }
 
 TEST_F(CodeSigningProcessingTest, LosingTheSystemContainerEntitlementStagesTheContainer) {
-  struct Row {
-    const char* label;
+  const struct {
     PlistDictionary entitlements;
     bool kept;
+  } rows[] = {
+      {{}, false},
+      {{{kKSTSystemContainerEntitlement, false}}, false},
+      {{{kKSTSystemContainerEntitlement, true}}, true},
   };
-  const Row rows[] = {
-      {"entitlement gone", {}, false},
-      {"entitlement NO", {{kKSTSystemContainerEntitlement, false}}, false},
-      {"entitlement still YES", {{kKSTSystemContainerEntitlement, true}}, true},
-  };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.label);
-    const std::string identifier = std::string("com.example.") + std::to_string(&row - rows);
-    ASSERT_EQ(process(infoWith({{kKSTSystemContainerEntitlement, true}}), identifier), kKSTSuccess);
+  for (const auto& row : rows) {
+    const std::string identifier = "com.example." + std::to_string(&row - rows);
+    SCOPED_TRACE(identifier);
+    ASSERT_EQ(process(infoWithEntitlements({{kKSTSystemContainerEntitlement, true}}), identifier),
+              kKSTSuccess);
     const KSTMetadataRef container = make(499, kKSTContainerClassDataSystem, identifier);
     ASSERT_TRUE(container);
-
-    EXPECT_EQ(process(infoWith(row.entitlements), identifier), kKSTSuccess);
+    EXPECT_EQ(process(infoWithEntitlements(row.entitlements), identifier), kKSTSuccess);
     EXPECT_EQ(fs::exists(container->url().path()), row.kept);
     EXPECT_EQ(fakes.logging->containsMessage("Deleting system container for ID: " + identifier +
                                              " because it is no longer in the entitlements"),
@@ -142,23 +96,16 @@ TEST_F(CodeSigningProcessingTest, LosingTheSystemContainerEntitlementStagesTheCo
 }
 
 TEST_F(CodeSigningProcessingTest, AFailedSystemContainerStagingIsLoggedOnly) {
-  auto sandbox = std::make_shared<HookedSandbox>();
-  fakes.services.sandbox = sandbox;
-  fakes.install();
-  ASSERT_EQ(process(infoWith({{kKSTSystemContainerEntitlement, true}}), "com.example.app"),
-            kKSTSuccess);
+  auto sandbox = std::make_shared<testing::HookedSandbox>();
+  useSandbox(sandbox);
+  ASSERT_EQ(
+      process(infoWithEntitlements({{kKSTSystemContainerEntitlement, true}}), "com.example.app"),
+      kKSTSuccess);
   const KSTMetadataRef container = make(499, kKSTContainerClassDataSystem, "com.example.app");
   ASSERT_TRUE(container);
   // The cache cannot drop the staged container: its class directory is gone.
-  sandbox->hook = [&] {
-    const fs::path classDirectory = fs::path(container->url().path()).parent_path();
-    KSTContainerCache::sharedInstance()._discardClassMapForUser(499, kKSTContainerClassDataSystem,
-                                                                false);
-    fs::rename(classDirectory, classDirectory.string() + ".aside");
-    std::ofstream(classDirectory.string()) << "not a directory";
-  };
-
-  EXPECT_EQ(process(infoWith({}), "com.example.app"), kKSTSuccess);
+  sandbox->hook = [&] { testing::breakClassDirectory(container); };
+  EXPECT_EQ(process(infoWithEntitlements({}), "com.example.app"), kKSTSuccess);
   EXPECT_FALSE(sandbox->hook);
   EXPECT_TRUE(fakes.logging->containsMessage(
       "Failed to destroy system container with identifier com.example.app: " +
@@ -168,72 +115,50 @@ TEST_F(CodeSigningProcessingTest, AFailedSystemContainerStagingIsLoggedOnly) {
 }
 
 TEST_F(CodeSigningProcessingTest, DroppingTheLastReferenceRemovesTheGroupContainer) {
-  ASSERT_EQ(
-      process(
-          infoWith({{kKSTApplicationGroupsEntitlement, PlistArray{"group.only", "group.shared"}}}),
-          "com.example.one"),
-      kKSTSuccess);
-  ASSERT_EQ(
-      process(infoWith({{kKSTApplicationGroupsEntitlement, "group.shared"}}), "com.example.two"),
-      kKSTSuccess);
-  make(501, kKSTContainerClassSharedAppGroup, "group.only");
-  make(501, kKSTContainerClassSharedAppGroup, "group.shared");
-
-  EXPECT_EQ(process(infoWith({}), "com.example.one"), kKSTSuccess);
-  EXPECT_FALSE(exists(501, kKSTContainerClassSharedAppGroup, "group.only"));
-  EXPECT_TRUE(exists(501, kKSTContainerClassSharedAppGroup, "group.shared"));
-
+  ASSERT_EQ(process(groups(PlistArray{"group.only", "group.shared"}), "com.example.one"),
+            kKSTSuccess);
+  ASSERT_EQ(process(groups("group.shared"), "com.example.two"), kKSTSuccess);
+  make(501, kAppGroup, "group.only");
+  make(501, kAppGroup, "group.shared");
+  EXPECT_EQ(process(infoWithEntitlements({}), "com.example.one"), kKSTSuccess);
+  EXPECT_FALSE(existingContainer(501, kAppGroup, "group.only"));
+  EXPECT_TRUE(existingContainer(501, kAppGroup, "group.shared"));
   // Removing the other one lets go of the last reference to the shared group.
   EXPECT_EQ(process(std::nullopt, "com.example.two"), kKSTSuccess);
-  EXPECT_FALSE(exists(501, kKSTContainerClassSharedAppGroup, "group.shared"));
-  EXPECT_FALSE(entry("com.example.two"));
+  EXPECT_FALSE(existingContainer(501, kAppGroup, "group.shared"));
+  EXPECT_FALSE(storedEntry("com.example.two"));
 }
 
-TEST_F(CodeSigningProcessingTest, PlugInsJoinAParentThatHasAnEntryOnce) {
-  ASSERT_EQ(process(infoWith({}), "com.example.app"), kKSTSuccess);
+TEST_F(CodeSigningProcessingTest, PlugInsJoinAParentOnceAndAreRemovedBeforeIt) {
+  ASSERT_EQ(process(groups("group.app"), "com.example.app"), kKSTSuccess);
   const PlistDictionary child{{kKSTParentBundleIDOption, "com.example.app"}};
   for (int run = 0; run < 2; ++run) {
-    EXPECT_EQ(process(infoWith({}), "com.example.app.ext", child), kKSTSuccess);
-    EXPECT_EQ(entry("com.example.app")->childBundleIdentifiers(), Strings{"com.example.app.ext"});
+    EXPECT_EQ(process(groups("group.ext"), "com.example.app.ext", child), kKSTSuccess);
+    EXPECT_EQ(storedEntry("com.example.app")->childBundleIdentifiers(),
+              Strings{"com.example.app.ext"});
   }
-  EXPECT_EQ(writes(), 2u);  // the parent's and the plug-in's entries, once
-
-  // The parent keeps its child when it is processed again.
-  EXPECT_EQ(process(infoWith({{"more", true}}), "com.example.app"), kKSTSuccess);
-  EXPECT_EQ(entry("com.example.app")->childBundleIdentifiers(), Strings{"com.example.app.ext"});
-
-  EXPECT_EQ(process(infoWith({}), "com.example.orphan.ext",
+  EXPECT_EQ(writes(), 2u);  // the parent's entry, then the plug-in's with the parent's child, once
+  // The parent keeps its child when it is processed again with new information.
+  EXPECT_EQ(process(groups(PlistArray{"group.app", "group.more"}), "com.example.app"), kKSTSuccess);
+  EXPECT_EQ(storedEntry("com.example.app")->childBundleIdentifiers(),
+            Strings{"com.example.app.ext"});
+  // A parent without an entry gets none.
+  EXPECT_EQ(process(infoWithEntitlements({}), "com.example.orphan.ext",
                     PlistDictionary{{kKSTParentBundleIDOption, "com.example.missing"}}),
             kKSTSuccess);
-  EXPECT_TRUE(entry("com.example.orphan.ext"));
-  EXPECT_FALSE(entry("com.example.missing"));
-}
+  EXPECT_TRUE(storedEntry("com.example.orphan.ext"));
+  EXPECT_FALSE(storedEntry("com.example.missing"));
 
-TEST_F(CodeSigningProcessingTest, NothingToRemoveAndNoIdentifier) {
-  EXPECT_EQ(process(std::nullopt, "com.example.unknown"), kKSTSuccess);
-  EXPECT_EQ(process(infoWith({}), std::nullopt), kKSTErrorMissingIdentifier);
-  EXPECT_EQ(firstLineStartingWith("Staging Code Signing Mapping"), fakes.logging->lines().size());
-  EXPECT_EQ(writes(), 0u);
-}
-
-TEST_F(CodeSigningProcessingTest, RemovalProcessesTheChildrenFirst) {
-  ASSERT_EQ(process(infoWith({{kKSTApplicationGroupsEntitlement, "group.app"}}), "com.example.app"),
-            kKSTSuccess);
-  const PlistDictionary child{{kKSTParentBundleIDOption, "com.example.app"}};
-  ASSERT_EQ(process(infoWith({{kKSTApplicationGroupsEntitlement, "group.ext"}}),
-                    "com.example.app.ext", child),
-            kKSTSuccess);
-  make(501, kKSTContainerClassSharedAppGroup, "group.app");
-  make(501, kKSTContainerClassSharedAppGroup, "group.ext");
-
+  // Removal takes the plug-in first; each releases its group on the way out.
+  make(501, kAppGroup, "group.app");
+  make(501, kAppGroup, "group.ext");
   fakes.logging->clear();
   KSTCodeSigningMapping::sharedInstance().removeCodeSigningDictionariesForIdentifierAndItsChildren(
       "com.example.app");
-  EXPECT_FALSE(entry("com.example.app"));
-  EXPECT_FALSE(entry("com.example.app.ext"));
-  // Each released its group on the way out, the plug-in first.
-  EXPECT_FALSE(exists(501, kKSTContainerClassSharedAppGroup, "group.app"));
-  EXPECT_FALSE(exists(501, kKSTContainerClassSharedAppGroup, "group.ext"));
+  EXPECT_FALSE(storedEntry("com.example.app"));
+  EXPECT_FALSE(storedEntry("com.example.app.ext"));
+  EXPECT_FALSE(existingContainer(501, kAppGroup, "group.app"));
+  EXPECT_FALSE(existingContainer(501, kAppGroup, "group.ext"));
   const std::size_t plugIn =
       firstLineStartingWith("Staging Code Signing Mapping for ID: com.example.app.ext");
   const std::size_t app =
@@ -243,39 +168,34 @@ TEST_F(CodeSigningProcessingTest, RemovalProcessesTheChildrenFirst) {
 }
 
 TEST_F(CodeSigningProcessingTest, CommandEighteenTakesDictionariesOnly) {
-  KSTClientConnection client(std::string("com.example.installer"), 0, true, std::nullopt);
-  auto run = [&](std::optional<PlistValue> info, std::optional<PlistValue> options,
-                 bool withIdentifier = true) {
-    platform::MessageDictionary request, reply;
-    if (info) request.setPlist("CodeSigningInfo", *info);
-    if (options) request.setPlist("OptionsDictionary", *options);
-    if (withIdentifier) request.setString("Identifier", "com.example.app");
-    std::uint64_t code = kKSTSuccess;
-    const KSTDeferredReply deferred(nullptr, platform::ReceivedMessage(request, nullptr, nullptr));
-    KSTCommandContext context{request, reply, client, &code, deferred};
-    KSTHandleProcessCodeSigningInfo(context);
-    return code;
+  auto run = [&](PlistDictionary request) {
+    request.emplace("Identifier", "com.example.app");
+    return testing::runHandler(KSTHandleProcessCodeSigningInfo, installer,
+                               testing::request(request));
   };
-  EXPECT_EQ(run(PlistValue(infoWith({})), PlistValue("not options")), kKSTSuccess);
-  ASSERT_TRUE(entry("com.example.app"));
-  EXPECT_EQ(entry("com.example.app")->dataContainerClass(), 0u);
-  EXPECT_EQ(run(PlistValue(infoWith({})), std::nullopt, false), kKSTErrorMissingIdentifier);
-  EXPECT_TRUE(entry("com.example.app"));
+  EXPECT_EQ(run({{"CodeSigningInfo", infoWithEntitlements({})}, {"OptionsDictionary", "no"}}),
+            kKSTSuccess);
+  ASSERT_TRUE(storedEntry("com.example.app"));
+  EXPECT_EQ(storedEntry("com.example.app")->dataContainerClass(), 0u);
+  EXPECT_EQ(testing::runHandler(KSTHandleProcessCodeSigningInfo, installer,
+                                testing::request({{"CodeSigningInfo", infoWithEntitlements({})}})),
+            kKSTErrorMissingIdentifier);
+  EXPECT_TRUE(storedEntry("com.example.app"));
   // Information that is not a dictionary removes the entry.
-  EXPECT_EQ(run(PlistValue(PlistArray{"x"}), std::nullopt), kKSTSuccess);
-  EXPECT_FALSE(entry("com.example.app"));
+  EXPECT_EQ(run({{"CodeSigningInfo", PlistArray{"x"}}}), kKSTSuccess);
+  EXPECT_FALSE(storedEntry("com.example.app"));
 }
+
+using CodeSigningProcessingConcurrencyTest = CodeSigningProcessingTest;
 
 // Unchanged caller-registered entitlements are answered without the lock on
 // all identifiers: a request of such a client does not wait behind a
 // creation holding it. Changed ones do wait for it.
-TEST(CodeSigningProcessingConcurrencyTest, UnchangedCallerEntitlementsDoNotTakeTheLock) {
-  testing::FakeServices fakes;
+TEST_F(CodeSigningProcessingConcurrencyTest, UnchangedCallerEntitlementsDoNotTakeTheLock) {
   KSTCodeSigningMapping& mapping = KSTCodeSigningMapping::sharedInstance();
   const PlistDictionary entitlements{{"com.zorvane.private.Kestrel.none", true}};
   ASSERT_EQ(mapping.processCallerRegisteredEntitlements(entitlements, "com.example.app"),
             kKSTSuccess);
-
   std::promise<void> held, release;
   std::thread holder([&] {
     KSTAllIdentifiersLockGuard all(kKSTLockForWriting);

@@ -4,17 +4,14 @@
 
 #include <optional>
 #include <string>
+#include <tuple>
 
 namespace kestrel {
 namespace {
 
 TEST(WhitelistTest, AnswersByClassAndComparesExactly) {
-  struct Row {
-    const char* identifier;
-    KSTContainerClass containerClass;
-    bool wellknown;
-  };
-  const Row rows[] = {
+  // Identifier, class and whether it is well known there.
+  const std::tuple<std::string, KSTContainerClass, bool> rows[] = {
       {"com.zorvane.egretd", 12, true},
       {"com.zorvane.ternd", 12, true},
       {"com.zorvane.egretd", 13, false},
@@ -32,19 +29,18 @@ TEST(WhitelistTest, AnswersByClassAndComparesExactly) {
       {"", 12, false},
   };
   const KSTWhitelist& whitelist = KSTWhitelist::sharedWhitelist();
-  for (const Row& row : rows) {
-    SCOPED_TRACE(std::string(row.identifier) + " class " + std::to_string(row.containerClass));
-    EXPECT_EQ(whitelist.containerIdIsWellknown(row.identifier, row.containerClass), row.wellknown);
-    EXPECT_EQ(whitelist.wellknownContainerForId(row.identifier, row.containerClass),
-              row.wellknown ? std::optional<std::string>(row.identifier) : std::nullopt);
-    if (row.containerClass == 12) {
-      EXPECT_EQ(whitelist.systemContainerIdIsWellknown(row.identifier), row.wellknown);
-      EXPECT_EQ(whitelist.wellknownSystemContainerForId(row.identifier).has_value(), row.wellknown);
+  for (const auto& [identifier, containerClass, wellknown] : rows) {
+    SCOPED_TRACE(identifier + " class " + std::to_string(containerClass));
+    EXPECT_EQ(whitelist.containerIdIsWellknown(identifier, containerClass), wellknown);
+    EXPECT_EQ(whitelist.wellknownContainerForId(identifier, containerClass),
+              wellknown ? std::optional(identifier) : std::nullopt);
+    if (containerClass == 12) {
+      EXPECT_EQ(whitelist.systemContainerIdIsWellknown(identifier), wellknown);
+      EXPECT_EQ(whitelist.wellknownSystemContainerForId(identifier).has_value(), wellknown);
     }
-    if (row.containerClass == 13) {
-      EXPECT_EQ(whitelist.systemGroupContainerIdIsWellknown(row.identifier), row.wellknown);
-      EXPECT_EQ(whitelist.wellknownSystemGroupContainerForId(row.identifier).has_value(),
-                row.wellknown);
+    if (containerClass == 13) {
+      EXPECT_EQ(whitelist.systemGroupContainerIdIsWellknown(identifier), wellknown);
+      EXPECT_EQ(whitelist.wellknownSystemGroupContainerForId(identifier).has_value(), wellknown);
     }
   }
 }

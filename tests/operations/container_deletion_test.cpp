@@ -4,41 +4,29 @@
 
 #include <algorithm>
 #include <filesystem>
-#include <fstream>
-#include <functional>
 #include <optional>
 #include <string>
-#include <utility>
 #include <vector>
 
-#include "codesigning/code_signing_mapping.h"
-#include "daemon/client_connection.h"
 #include "daemon/error_codes.h"
-#include "daemon/request_dispatch.h"
 #include "store/container_cache.h"
 #include "store/global_configuration.h"
-#include "support/fake_services.h"
+#include "support/store_test_helpers.h"
 
 namespace kestrel {
 namespace {
 
 namespace fs = std::filesystem;
+using testing::storedEntry;
 using Identifiers = std::optional<std::vector<std::optional<std::string>>>;
 using Classes = std::vector<std::optional<KSTContainerClass>>;
-using Uuids = std::vector<std::optional<platform::Uuid>>;
+using Strings = std::vector<std::string>;
 
 constexpr std::uint64_t kSandboxItemTypeData = 1;
+constexpr const char* kStageTag = "stageForDeleteContainersWithUsers";
 
-class ContainerDeletionTest : public ::testing::Test {
+class ContainerDeletionTest : public testing::StoreTest {
  protected:
-  KSTMetadataRef create(std::uint32_t user, KSTContainerClass containerClass,
-                        const std::string& identifier, bool transient = false) {
-    std::uint64_t code = kKSTSuccess;
-    KSTMetadataRef made = client.createOrLookupContainerForUser(
-        user, identifier, true, containerClass, transient, true, &code);
-    EXPECT_TRUE(made) << code;
-    return made;
-  }
   static bool cached(const KSTMetadataRef& container) {
     return KSTContainerCache::sharedInstance().containerForUser(
                container->uid(), container->containerClass(), container->identifier(),
@@ -54,7 +42,7 @@ class ContainerDeletionTest : public ::testing::Test {
   }
   std::uint64_t stage(const std::vector<KSTMetadataRef>& containers) {
     std::vector<std::uint32_t> users;
-    Uuids uuids;
+    std::vector<std::optional<platform::Uuid>> uuids;
     Identifiers identifiers(std::in_place);
     Classes classes;
     for (const KSTMetadataRef& container : containers) {
@@ -64,238 +52,167 @@ class ContainerDeletionTest : public ::testing::Test {
       classes.emplace_back(container->containerClass());
     }
     std::uint64_t code = kKSTSuccess;
-    client.stageForDeleteContainersWithUsers(users, uuids, identifiers, classes, true, &code);
+    installer.stageForDeleteContainersWithUsers(users, uuids, identifiers, classes, true, &code);
     return code;
   }
   // The lines of the tag, without the source line that leads each one.
-  std::vector<std::string> linesFrom(std::string_view tag) const {
-    std::vector<std::string> messages;
+  Strings linesFrom(std::string_view tag) const {
+    Strings messages;
     for (const auto& line : fakes.logging->lines()) {
-      if (line.tag != tag) continue;
       const std::size_t start = line.message.find(": ");
-      messages.push_back(start == std::string::npos ? line.message
-                                                    : line.message.substr(start + 2));
+      if (line.tag == tag) {
+        messages.push_back(start == std::string::npos ? line.message
+                                                      : line.message.substr(start + 2));
+      }
     }
     return messages;
   }
   bool loggedFrom(std::string_view tag, std::string_view prefix) const {
-    const std::vector<std::string> lines = linesFrom(tag);
+    const Strings lines = linesFrom(tag);
     return std::any_of(lines.begin(), lines.end(),
-                       [&](const std::string& line) { return line.rfind(prefix, 0) == 0; });
+                       [&](const std::string& line) { return line.starts_with(prefix); });
   }
-
-  testing::FakeServices fakes;
-  KSTClientConnection client{std::string("com.example.installer"), 0, true, std::nullopt};
 };
 
 TEST_F(ContainerDeletionTest, BatchSkipsBadAndMissingEntriesAndStagesTheRealOnes) {
-  const KSTMetadataRef app = create(501, 2, "com.example.app");
-  const KSTMetadataRef bundle = create(33, 1, "com.example.app");
+  const KSTMetadataRef app = make(501, 2, "com.example.app");
+  const KSTMetadataRef bundle = make(33, 1, "com.example.app");
   ASSERT_TRUE(app && bundle);
-  ASSERT_TRUE(client._setSandboxContainerMappingForUser(501, "com.example.app", 2, app->url()));
+  ASSERT_TRUE(installer._setSandboxContainerMappingForUser(501, "com.example.app", 2, app->url()));
   // A bundle takes the code-signing entries of its identifier and children along.
-  KSTCodeSigningMapping& mapping = KSTCodeSigningMapping::sharedInstance();
   KSTCodeSigningEntry parent(PlistDictionary{}, 2);
-  parent.setChildBundleIdentifiers(std::vector<std::string>{"com.example.app.ext"});
-  mapping.withState(true, [&](KSTCodeSigningMappingState& state) {
-    return !state._setCodeSigningDictionaryValues(
-        {parent, KSTCodeSigningEntry(PlistDictionary{}, 4)},
-        {"com.example.app", "com.example.app.ext"});
-  });
-  auto hasEntry = [&](const char* identifier) {
-    return mapping.withState(false, [&](KSTCodeSigningMappingState& state) {
-      return state.entryForIdentifier(identifier) != nullptr;
-    });
-  };
-  ASSERT_TRUE(hasEntry("com.example.app") && hasEntry("com.example.app.ext"));
-  ASSERT_TRUE(fakes.sandbox->userStateItem(501, kSandboxItemTypeData, "com.example.app"));
+  parent.setChildBundleIdentifiers(Strings{"com.example.app.ext"});
+  ASSERT_EQ(testing::storeEntries(KSTCodeSigningMapping::sharedInstance(),
+                                  {parent, KSTCodeSigningEntry(PlistDictionary{}, 4)},
+                                  {"com.example.app", "com.example.app.ext"}),
+            nullptr);
   fakes.sandbox->clearCalls();
 
   const std::string id = "com.example.app";
   std::uint64_t code = kKSTSuccess;
-  client.stageForDeleteContainersWithUsers(
+  installer.stageForDeleteContainersWithUsers(
       {501, 502, 503, 504, 501, 501},
       {app->uuid(), std::nullopt, app->uuid(), app->uuid(), platform::Uuid::random(), app->uuid()},
       Identifiers{{id, id, std::nullopt, id, id, id}}, {std::nullopt, 2, 2, 14, 2, 2}, true, &code);
   EXPECT_EQ(code, kKSTSuccess);
-
   EXPECT_TRUE(staged(app));
   EXPECT_FALSE(cached(app));
   EXPECT_FALSE(fakes.sandbox->userStateItem(501, kSandboxItemTypeData, id));
   ASSERT_EQ(fakes.sandbox->calls().size(), 1u);  // only the real entry reached the sandbox
   EXPECT_TRUE(fakes.sandbox->calls()[0].isRemoval());
   // A data container leaves the entries alone.
-  EXPECT_TRUE(hasEntry("com.example.app") && hasEntry("com.example.app.ext"));
-
+  EXPECT_TRUE(storedEntry("com.example.app") && storedEntry("com.example.app.ext"));
   EXPECT_EQ(stage({bundle}), kKSTSuccess);
   EXPECT_TRUE(staged(bundle));
-  EXPECT_FALSE(hasEntry("com.example.app"));
-  EXPECT_FALSE(hasEntry("com.example.app.ext"));
+  EXPECT_FALSE(storedEntry("com.example.app"));
+  EXPECT_FALSE(storedEntry("com.example.app.ext"));
 
   // One line for each bad entry; the entry of no container passes silently.
+  const std::string invalid = "Can't act on an invalid object: ";
   const std::string uuid = app->uuid().string();
-  const std::vector<std::string> expected = {
-      "Can't act on an invalid object: class: (null)",
-      "Can't act on an invalid object: userId: 502, UUID: (null), ID: com.example.app, "
-      "Class: 2",
-      "Can't act on an invalid object: userId: 503, UUID: " + uuid + ", ID: (null), Class: 2",
-      "Can't act on an invalid object: userId: 504, UUID: " + uuid +
-          ", ID: com.example.app, Class: 14",
-  };
-  EXPECT_EQ(linesFrom("stageForDeleteContainersWithUsers"), expected);
-
+  EXPECT_EQ(linesFrom(kStageTag),
+            (Strings{invalid + "class: (null)",
+                     invalid + "userId: 502, UUID: (null), ID: com.example.app, Class: 2",
+                     invalid + "userId: 503, UUID: " + uuid + ", ID: (null), Class: 2",
+                     invalid + "userId: 504, UUID: " + uuid + ", ID: com.example.app, Class: 14"}));
   // Staging what is already staged finds nothing and is no failure.
   EXPECT_EQ(stage({app}), kKSTSuccess);
 }
 
 TEST_F(ContainerDeletionTest, MismatchedCountsFailBeforeAnythingMoves) {
-  const KSTMetadataRef app = create(501, 2, "com.example.app");
+  const KSTMetadataRef app = make(501, 2, "com.example.app");
   ASSERT_TRUE(app);
   const Identifiers one{{app->identifier()}};
-  struct Row {
-    const char* label;
-    std::vector<std::uint32_t> users;
-    Identifiers identifiers;
-    Classes classes;
-    const char* message;
-  } rows[] = {
-      {"no classes", {501}, one, {}, "UUIDString count: 1, class count: 0, ID count: 1"},
-      {"an identifier too many",
-       {501},
-       Identifiers{{"a", "b"}},
-       {2},
-       "UUIDString count: 1, class count: 1, ID count: 2"},
-      {"no users", {}, one, {2}, "UUIDString count: 1, user count: 0"},
+  const std::tuple<std::vector<std::uint32_t>, Identifiers, Classes, const char*> rows[] = {
+      {{501}, one, {}, "UUIDString count: 1, class count: 0, ID count: 1"},
+      {{501}, Identifiers{{"a", "b"}}, {2}, "UUIDString count: 1, class count: 1, ID count: 2"},
+      {{}, one, {2}, "UUIDString count: 1, user count: 0"},
   };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.label);
+  for (const auto& [users, identifiers, classes, message] : rows) {
+    SCOPED_TRACE(message);
     std::uint64_t code = kKSTSuccess;
-    client.stageForDeleteContainersWithUsers(row.users, {app->uuid()}, row.identifiers, row.classes,
-                                             true, &code);
+    installer.stageForDeleteContainersWithUsers(users, {app->uuid()}, identifiers, classes, true,
+                                                &code);
     EXPECT_EQ(code, kKSTErrorInvalidObject);
-    EXPECT_TRUE(loggedFrom("stageForDeleteContainersWithUsers",
-                           std::string("Can't act on an invalid input: ") + row.message));
+    EXPECT_TRUE(loggedFrom(kStageTag, std::string("Can't act on an invalid input: ") + message));
     EXPECT_TRUE(cached(app));
   }
   // An empty batch without an identifiers array is no failure.
   std::uint64_t code = kKSTSuccess;
-  client.stageForDeleteContainersWithUsers({}, {}, std::nullopt, {}, true, &code);
+  installer.stageForDeleteContainersWithUsers({}, {}, std::nullopt, {}, true, &code);
   EXPECT_EQ(code, kKSTSuccess);
 }
 
-// Removals of the identifier named run the hook first (once).
-class HookedSandbox final : public platform::Sandbox {
- public:
-  int setUserStateItem(std::uint32_t, std::uint64_t, const std::string& identifier,
-                       const std::optional<std::string>& path, std::uint64_t) override {
-    if (!path) removals.push_back(identifier);
-    if (!path && identifier == hookIdentifier && hook) std::exchange(hook, nullptr)();
-    return 0;
-  }
-  std::optional<std::string> userStateItem(std::uint32_t, std::uint64_t,
-                                           const std::string&) const override {
-    return std::nullopt;
-  }
-  std::vector<platform::SandboxUserStateItem> userStateItems() const override { return {}; }
-
-  std::string hookIdentifier;
-  std::function<void()> hook;
-  std::vector<std::string> removals;
-};
-
 TEST_F(ContainerDeletionTest, AFailedCacheRemovalEndsTheBatch) {
-  auto sandbox = std::make_shared<HookedSandbox>();
-  fakes.services.sandbox = sandbox;
-  fakes.install();
-  const KSTMetadataRef plugin = create(501, 4, "com.example.plugin");
-  const KSTMetadataRef app = create(501, 2, "com.example.app");
-  const KSTMetadataRef group = create(501, 7, "group.com.example");
+  auto sandbox = std::make_shared<testing::HookedSandbox>();
+  useSandbox(sandbox);
+  const KSTMetadataRef plugin = make(501, 4, "com.example.plugin");
+  const KSTMetadataRef app = make(501, 2, "com.example.app");
+  const KSTMetadataRef group = make(501, 7, "group.com.example");
   ASSERT_TRUE(plugin && app && group);
-
   // Just before the app's cache entry goes, its class map has to be rebuilt
   // from a class directory that cannot be listed.
-  sandbox->hookIdentifier = "com.example.app";
-  sandbox->hook = [&] {
-    const fs::path classDirectory = fs::path(app->url().path()).parent_path();
-    KSTContainerCache::sharedInstance()._discardClassMapForUser(501, 2, false);
-    fs::rename(classDirectory, classDirectory.string() + ".aside");
-    std::ofstream(classDirectory.string()) << "not a directory";
-  };
+  sandbox->identifier = "com.example.app";
+  sandbox->hook = [&] { testing::breakClassDirectory(app); };
 
   EXPECT_EQ(stage({plugin, app, group}), kKSTErrorCacheRemoveFailed);
-  EXPECT_TRUE(loggedFrom("stageForDeleteContainersWithUsers",
-                         "Failed to remove from cache id: com.example.app, class: 2, "
-                         "transient: 0 ("));
+  EXPECT_TRUE(loggedFrom(
+      kStageTag, "Failed to remove from cache id: com.example.app, class: 2, transient: 0 ("));
   EXPECT_TRUE(staged(plugin));
   EXPECT_FALSE(cached(plugin));
   EXPECT_TRUE(fs::is_directory(deathRow() / fs::path(app->url().path()).filename()));
   // The group after it was never reached.
   EXPECT_TRUE(fs::is_directory(group->url().path()));
   EXPECT_TRUE(cached(group));
-  EXPECT_EQ(sandbox->removals, (std::vector<std::string>{"com.example.plugin", "com.example.app"}));
+  EXPECT_EQ(sandbox->removals, (Strings{"com.example.plugin", "com.example.app"}));
 }
 
 TEST_F(ContainerDeletionTest, DeleteOneFindsTheContainerByIdentifier) {
-  const KSTMetadataRef app = create(501, 2, "com.example.app");
-  const KSTMetadataRef temporary = create(501, 2, "com.example.app", /*transient=*/true);
+  const KSTMetadataRef app = make(501, 2, "com.example.app");
+  const KSTMetadataRef temporary = make(501, 2, "com.example.app", /*transient=*/true);
   ASSERT_TRUE(app && temporary);
-  const fs::path temporaryPlace = temporary->url().path();
-
-  struct Row {
-    const char* identifier;
-    bool transient;
-    std::uint64_t code;
-  } rows[] = {
+  // A transient container is retired by the lookup itself, which then finds
+  // nothing to hand over.
+  const std::tuple<const char*, bool, std::uint64_t> rows[] = {
       {"com.example.none", false, kKSTErrorNotFound},
       {"com.example.app", false, kKSTSuccess},
-      // A transient container is retired by the lookup itself, which then
-      // finds nothing to hand over.
       {"com.example.app", true, kKSTErrorNotFound},
   };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(::testing::Message() << row.identifier << " transient " << row.transient);
+  for (const auto& [identifier, transient, expected] : rows) {
+    SCOPED_TRACE(::testing::Message() << identifier << " transient " << transient);
     std::uint64_t code = kKSTSuccess;
-    client.deleteContainerForUser(501, std::string(row.identifier), 2, row.transient, &code);
-    EXPECT_EQ(code, row.code);
+    installer.deleteContainerForUser(501, std::string(identifier), 2, transient, &code);
+    EXPECT_EQ(code, expected);
     const std::string failure =
-        std::string("Failed to lookup existing container to delete-identifier: ") + row.identifier +
-        ", class: 2, transient: " + (row.transient ? "1" : "0");
+        std::string("Failed to lookup existing container to delete-identifier: ") + identifier +
+        ", class: 2, transient: " + (transient ? "1" : "0");
     EXPECT_EQ(fakes.logging->contains("deleteContainerForUser", failure), code != kKSTSuccess);
   }
   EXPECT_TRUE(staged(app));
   EXPECT_FALSE(cached(app));
-  EXPECT_FALSE(fs::exists(temporaryPlace));
+  EXPECT_FALSE(fs::exists(temporary->url().path()));
   EXPECT_FALSE(cached(temporary));
 }
 
 TEST_F(ContainerDeletionTest, CommandsThreeAndTenAnswerThroughTheDispatcher) {
-  ASSERT_TRUE(KSTStartRequestListener(platform::DispatchQueue::createConcurrent("test.listener")));
-  const KSTMetadataRef first = create(501, 2, "com.example.first");
-  const KSTMetadataRef second = create(501, 7, "group.com.example");
+  const KSTMetadataRef first = make(501, 2, "com.example.first");
+  const KSTMetadataRef second = make(501, 7, "group.com.example");
   ASSERT_TRUE(first && second);
-
-  auto connection = fakes.connectAllowedClient("com.example.client");
-
-  platform::MessageDictionary stageRequest;
-  stageRequest.setUint64("Command", 3);
-  stageRequest.setArray("ContainerClassesArray", {platform::MessageValue::fromUint64(2)});
+  connectThroughDispatcher("com.example.client");
+  auto stageRequest = testing::request({{"Command", 3u},
+                                        {"ContainerClassesArray", PlistArray{2u}},
+                                        {"UserIDsArray", PlistArray{1u}},
+                                        {"IdentifiersArray", PlistArray{"com.example.first"}}});
   stageRequest.setArray("UUIDsArray", {platform::MessageValue::fromUuid(first->uuid())});
-  stageRequest.setArray("UserIDsArray", {platform::MessageValue::fromUint64(1)});
-  ASSERT_TRUE(stageRequest.setPlist("IdentifiersArray", PlistArray{"com.example.first"}));
-  ASSERT_TRUE(connection->deliver(stageRequest));
-  EXPECT_EQ(connection->lastReply()->uint64("ReplyError"), kKSTSuccess);
+  EXPECT_EQ(ask(stageRequest), kKSTSuccess);
   EXPECT_TRUE(staged(first));
-
-  platform::MessageDictionary deleteRequest;
-  deleteRequest.setUint64("Command", 10);
-  deleteRequest.setUint64("ContainerClass", 7);
-  deleteRequest.setUint64("UserID", 501);
-  deleteRequest.setString("Identifier", "group.com.example");
-  ASSERT_TRUE(connection->deliver(deleteRequest));
-  EXPECT_EQ(connection->lastReply()->uint64("ReplyError"), kKSTSuccess);
+  const auto deleteRequest = testing::request({{"Command", 10u},
+                                               {"ContainerClass", 7u},
+                                               {"UserID", 501u},
+                                               {"Identifier", "group.com.example"}});
+  EXPECT_EQ(ask(deleteRequest), kKSTSuccess);
   EXPECT_TRUE(staged(second));
-  ASSERT_TRUE(connection->deliver(deleteRequest));
-  EXPECT_EQ(connection->lastReply()->uint64("ReplyError"), kKSTErrorNotFound);
+  EXPECT_EQ(ask(deleteRequest), kKSTErrorNotFound);
   EXPECT_FALSE(connection->cancelled());
 }
 

@@ -1,48 +1,40 @@
 #include "store/metadata.h"
 
-#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <plist/plist.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 #include <filesystem>
 #include <fstream>
 #include <functional>
 #include <memory>
-#include <variant>
 
-#include "platform/data_protection.h"
-#include "platform/unique_fd.h"
 #include "store/plist_io.h"
-#include "support/fake_services.h"
+#include "support/store_test_helpers.h"
 
 namespace kestrel {
 namespace {
 
 namespace fs = std::filesystem;
+using testing::messageOf;
 
 constexpr const char* kUuidText = "6F1B2C3D-4E5F-4A6B-8C7D-9E0F1A2B3C4D";
 
 class MetadataTest : public ::testing::Test {
  protected:
   // A container directory of a class beneath mobile's Containers directory.
-  KSTFileURL containerAt(std::string_view classPath, std::string_view name = "CONTAINER") const {
+  KSTFileURL containerAt(std::string_view classPath, const std::string& name) const {
     const std::string path = fakes.scratch.resolve("/private/var/mobile/Containers/") +
-                             std::string(classPath) + "/" + std::string(name);
+                             std::string(classPath) + "/" + name;
     fs::create_directories(path);
     return KSTFileURL(path, true);
   }
   static std::string metadataPath(const KSTFileURL& container) {
     return KSTMetadata::metadataFileURL(container).path();
   }
-  static void writeDictionary(const KSTFileURL& container, const PlistDictionary& dictionary) {
-    KSTErrorRef error;
+  static void write(const KSTFileURL& container, const PlistDictionary& dictionary) {
     ASSERT_TRUE(KST_writeToURL(dictionary, KSTMetadata::metadataFileURL(container),
-                               kKSTDaemonFileWritingOptions, &error));
-  }
-  static void writeRaw(const KSTFileURL& container, std::string_view bytes) {
-    std::ofstream(metadataPath(container), std::ios::binary | std::ios::trunc) << bytes;
+                               kKSTDaemonFileWritingOptions, nullptr));
   }
   static PlistDictionary valid() {
     return PlistDictionary{{kKSTMetadataIdentifierKey, "com.example.app"},
@@ -50,131 +42,105 @@ class MetadataTest : public ::testing::Test {
                            {kKSTMetadataContentClassKey, 2u},
                            {kKSTMetadataPersonaKey, 501u}};
   }
-  static PlistDictionary with(PlistDictionary d, const char* key, PlistValue value) {
+  static PlistDictionary with(const char* key, PlistValue value, PlistDictionary d = valid()) {
     d[key] = std::move(value);
     return d;
   }
-  static PlistDictionary without(PlistDictionary d, const char* key) {
+  static PlistDictionary without(const char* key, PlistDictionary d = valid()) {
     d.erase(key);
     return d;
   }
-  static std::string messageOf(const KSTErrorRef& error) {
-    return error ? error->localizedDescription().value_or("") : "";
+  // Reads the container as user 501 of its class and expects the error.
+  void expectRefused(const KSTFileURL& container, std::int64_t code, const std::string& message,
+                     std::uint32_t user = 501) {
+    fakes.logging->clear();
+    KSTErrorRef error;
+    EXPECT_EQ(KSTMetadata::readAndValidateMetadataAtUrl(container, user, true, &error), nullptr);
+    EXPECT_TRUE(testing::isError(error, code, message, kKSTErrorDomain));
+    EXPECT_TRUE(fakes.logged(message));  // by the error builder
   }
 
   testing::FakeServices fakes;
+  int containers = 0;
 };
 
-// What to put in the metadata file of a row: nothing, a dictionary, raw bytes,
-// or whatever the function makes at the file's path.
-struct NoFile {};
-using MakeFile = std::function<void(const std::string& path)>;
-using Contents = std::variant<NoFile, PlistDictionary, std::string, MakeFile>;
-
-TEST_F(MetadataTest, HostileFilesGiveTheirCodeAndMessage) {
+TEST_F(MetadataTest, UnreadableFilesFailWith12) {
   const KSTFileURL good = containerAt("Data/Application", "GOOD");
-  writeDictionary(good, valid());
-  struct Row {
-    const char* label;
-    Contents contents;
-    std::uint64_t code;
-    std::string message;  // "@" stands for the container path.
-    std::uint32_t user = 501;
-    const char* classPath = "Data/Application";
-  };
-  const Row rows[] = {
-      {"no file", NoFile{}, 12, "Failed to read metadata at URL @"},
+  write(good, valid());
+  const std::pair<const char*, std::function<void(const std::string&)>> rows[] = {
+      {"no file", [](const std::string&) {}},
       {"top-level array",
-       std::string("<?xml version=\"1.0\"?><plist version=\"1.0\"><array/></plist>"), 12,
-       "Failed to read metadata at URL @"},
+       [](const std::string& p) {
+         std::ofstream(p) << "<?xml version=\"1.0\"?><plist version=\"1.0\"><array/></plist>";
+       }},
       {"link to a valid file",
-       MakeFile([&](const std::string& p) { fs::create_symlink(metadataPath(good), p); }), 12,
-       "Failed to read metadata at URL @"},
-      {"fifo", MakeFile([](const std::string& p) { ASSERT_EQ(::mkfifo(p.c_str(), 0644), 0); }), 12,
-       "Failed to read metadata at URL @"},
-      {"larger than any metadata", MakeFile([](const std::string& p) {
+       [&](const std::string& p) { fs::create_symlink(metadataPath(good), p); }},
+      {"fifo", [](const std::string& p) { ASSERT_EQ(::mkfifo(p.c_str(), 0644), 0); }},
+      {"larger than any metadata",
+       [](const std::string& p) {
          std::ofstream(p) << "x";
          fs::resize_file(p, std::uintmax_t{64} * 1024 * 1024);
-       }),
-       12, "Failed to read metadata at URL @"},
-      {"no identifier", without(valid(), kKSTMetadataIdentifierKey), 29,
-       "Invalid metadata Identifier: (null) at @"},
-      {"no UUID", without(valid(), kKSTMetadataUUIDKey), 29,
-       "Invalid metadata UUID String: (null) at @"},
-      {"unparsable UUID", with(valid(), kKSTMetadataUUIDKey, "not-a-uuid"), 29,
-       "Invalid metadata UUID: not-a-uuid at @"},
-      {"string class", with(valid(), kKSTMetadataContentClassKey, "2"), 29,
-       "Invalid metadata Class: 2 at @"},
-      {"class 14", with(valid(), kKSTMetadataContentClassKey, 14), 29,
-       "Invalid metadata Content Class: 14 at @"},
-      {"another user's persona", valid(), 29,
-       "Incorrect UserId: 501, expecting: 502 for com.example.app at @", 502},
-      {"persona wider than a user id",
-       with(valid(), kKSTMetadataPersonaKey, std::uint64_t{501} + (std::uint64_t{1} << 32)), 29,
-       "Incorrect UserId: 4294967797, expecting: 501 for com.example.app at @"},
-      {"info that is no dictionary", with(valid(), kKSTMetadataInfoKey, "x"), 29,
-       "Invalid metadata Info: x at @"},
-      {"class of another directory", valid(), 29,
-       "Invalid metadata-URLs should match: @ : " +
-           fakes.scratch.resolve("/private/var/mobile/Containers/Data/Application"),
-       501, "Data/VantlerPlugin"},
+       }},
   };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.label);
-    const KSTFileURL container = containerAt(row.classPath, "C" + std::to_string(&row - rows));
-    if (const auto* dictionary = std::get_if<PlistDictionary>(&row.contents)) {
-      writeDictionary(container, *dictionary);
-    } else if (const auto* raw = std::get_if<std::string>(&row.contents)) {
-      writeRaw(container, *raw);
-    } else if (const auto* make = std::get_if<MakeFile>(&row.contents)) {
-      (*make)(metadataPath(container));
-    }
-    fakes.logging->clear();
-    KSTErrorRef error;
-    EXPECT_EQ(KSTMetadata::readAndValidateMetadataAtUrl(container, row.user, true, &error),
-              nullptr);
-    ASSERT_NE(error, nullptr);
-    EXPECT_EQ(error->domain(), kKSTErrorDomain);
-    EXPECT_EQ(error->code(), static_cast<std::int64_t>(row.code));
-    std::string expected = row.message;
-    expected.replace(expected.find('@'), 1, container.path());
-    EXPECT_EQ(messageOf(error), expected);
-    EXPECT_TRUE(fakes.logged(expected));  // by the error builder
+  for (const auto& [label, makeFile] : rows) {
+    SCOPED_TRACE(label);
+    const KSTFileURL container = containerAt("Data/Application", label);
+    makeFile(metadataPath(container));
+    expectRefused(container, 12, "Failed to read metadata at URL " + container.path());
+  }
+}
+
+TEST_F(MetadataTest, InvalidContentsFailWith29AndNameWhatIsWrong) {
+  const std::tuple<PlistDictionary, std::string, std::uint32_t, const char*> rows[] = {
+      {without(kKSTMetadataIdentifierKey), "Invalid metadata Identifier: (null)", 501, ""},
+      {without(kKSTMetadataUUIDKey), "Invalid metadata UUID String: (null)", 501, ""},
+      {with(kKSTMetadataUUIDKey, "not-a-uuid"), "Invalid metadata UUID: not-a-uuid", 501, ""},
+      {with(kKSTMetadataContentClassKey, "2"), "Invalid metadata Class: 2", 501, ""},
+      {with(kKSTMetadataContentClassKey, 14), "Invalid metadata Content Class: 14", 501, ""},
+      {valid(), "Incorrect UserId: 501, expecting: 502 for com.example.app", 502, ""},
+      {with(kKSTMetadataPersonaKey, std::uint64_t{501} + (std::uint64_t{1} << 32)),
+       "Incorrect UserId: 4294967797, expecting: 501 for com.example.app", 501, ""},
+      {with(kKSTMetadataInfoKey, "x"), "Invalid metadata Info: x", 501, ""},
+      // A container of one class with the metadata of another.
+      {valid(), "Invalid metadata-URLs should match", 501, "Data/VantlerPlugin"},
+  };
+  for (const auto& [contents, message, user, otherClassPath] : rows) {
+    SCOPED_TRACE(message);
+    const std::string name = "C" + std::to_string(++containers);
+    const bool elsewhere = *otherClassPath != '\0';
+    const KSTFileURL container = containerAt(elsewhere ? otherClassPath : "Data/Application", name);
+    write(container, contents);
+    const std::string at =
+        elsewhere ? ": " + container.path() + " : " +
+                        fakes.scratch.resolve("/private/var/mobile/Containers/Data/Application")
+                  : " at " + container.path();
+    expectRefused(container, 29, message + at, user);
   }
 }
 
 TEST_F(MetadataTest, AcceptedFilesGiveARecordOfTheExpectedUser) {
-  struct Row {
-    const char* label;
-    PlistDictionary contents;
-    std::uint32_t user;
-    bool checkClassPath;
-    const char* classPath;
-    KSTContainerClass containerClass;
-  };
-  const Row rows[] = {
-      {"no persona, another mobile user", without(valid(), kKSTMetadataPersonaKey), 502, true,
-       "Data/Application", 2},
-      {"no persona, installer's bundle",
-       without(with(valid(), kKSTMetadataContentClassKey, 1), kKSTMetadataPersonaKey), 33, true,
+  const std::tuple<PlistDictionary, std::uint32_t, bool, const char*, KSTContainerClass> rows[] = {
+      // No persona: another mobile user's, and the installer's bundle.
+      {without(kKSTMetadataPersonaKey), 502, true, "Data/Application", 2},
+      {without(kKSTMetadataPersonaKey, with(kKSTMetadataContentClassKey, 1)), 33, true,
        "Bundle/Application", 1},
-      {"another class directory, unchecked", valid(), 501, false, "Data/VantlerPlugin", 2},
-      {"lower-case UUID and extra keys",
-       with(with(valid(), kKSTMetadataUUIDKey, "6f1b2c3d-4e5f-4a6b-8c7d-9e0f1a2b3c4d"), "Other",
-            PlistArray{1, 2}),
+      // Another class directory, not checked.
+      {valid(), 501, false, "Data/VantlerPlugin", 2},
+      {with("Other", PlistArray{1, 2},
+            with(kKSTMetadataUUIDKey, "6f1b2c3d-4e5f-4a6b-8c7d-9e0f1a2b3c4d")),
        501, true, "Data/Application", 2},
   };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.label);
-    const KSTFileURL container = containerAt(row.classPath, "C" + std::to_string(&row - rows));
-    writeDictionary(container, row.contents);
+  for (const auto& [contents, user, checkClassPath, classPath, containerClass] : rows) {
+    SCOPED_TRACE(classPath);
+    const KSTFileURL container = containerAt(classPath, "C" + std::to_string(++containers));
+    write(container, contents);
     KSTErrorRef error;
     auto record =
-        KSTMetadata::readAndValidateMetadataAtUrl(container, row.user, row.checkClassPath, &error);
-    ASSERT_NE(record, nullptr) << FormatArg(error).description();
-    EXPECT_EQ(record->uid(), row.user);
+        KSTMetadata::readAndValidateMetadataAtUrl(container, user, checkClassPath, &error);
+    ASSERT_NE(record, nullptr) << messageOf(error);
+    EXPECT_EQ(record->uid(), user);
     EXPECT_EQ(record->identifier(), "com.example.app");
-    EXPECT_EQ(record->containerClass(), row.containerClass);
+    EXPECT_EQ(record->containerClass(), containerClass);
     EXPECT_EQ(record->uuid().string(), kUuidText);
     EXPECT_EQ(record->url(), container);
   }
@@ -197,18 +163,13 @@ TEST_F(MetadataTest, WrittenRecordReadsBackAndIsAStandardBinaryPropertyList) {
                              {"Nested", PlistDictionary{{"Data", PlistData{1, 2, 3}}}}};
   record->setInfo(info);
   KSTErrorRef error;
-  ASSERT_TRUE(record->writeMetadataToDiskWithError(&error)) << FormatArg(error).description();
-
+  ASSERT_TRUE(record->writeMetadataToDiskWithError(&error)) << messageOf(error);
   auto back = KSTMetadata::readAndValidateMetadataAtUrl(container, 501, true, &error);
-  ASSERT_NE(back, nullptr) << FormatArg(error).description();
+  ASSERT_NE(back, nullptr) << messageOf(error);
   EXPECT_EQ(back->uuid(), uuid);
   ASSERT_TRUE(back->info());
   EXPECT_EQ(PlistValue(*back->info()), PlistValue(info));
-
-  const platform::UniqueFd fd(::open(metadataPath(container).c_str(), O_RDONLY));
-  std::optional<std::int32_t> protectionClass;
-  ASSERT_EQ(platform::getProtectionClass(fd.get(), &protectionClass), 0);
-  EXPECT_EQ(protectionClass, 4);
+  EXPECT_EQ(testing::protectionClassOf(metadataPath(container)), 4);
 
   // What any property-list reader sees.
   std::ifstream in(metadataPath(container), std::ios::binary);
@@ -232,30 +193,18 @@ TEST_F(MetadataTest, WrittenRecordReadsBackAndIsAStandardBinaryPropertyList) {
   EXPECT_EQ(std::string(text), uuid.string());
   EXPECT_EQ(std::string(text).find_first_of("abcdef"), std::string::npos);
   std::free(text);
-}
 
-TEST_F(MetadataTest, WriteFailuresGiveCode34WithTheWritersError) {
-  struct Row {
-    const char* label;
-    KSTFileURL url;
-    std::string identifier;
-  };
-  const Row rows[] = {
-      {"missing directory", KSTFileURL(fakes.scratch.resolve("/nowhere/C"), true), "com.a"},
-      {"identifier that is no UTF-8", containerAt("Data/Application", "BAD"),
-       std::string("com.\xff\xfe")},
-  };
-  for (const Row& row : rows) {
-    SCOPED_TRACE(row.label);
-    auto record = KSTMetadata::initWithUserId(501, platform::Uuid::random(), 2, row.identifier,
-                                              std::nullopt, row.url);
-    KSTErrorRef error;
-    EXPECT_FALSE(record->writeMetadataToDiskWithError(&error));
-    ASSERT_NE(error, nullptr);
-    EXPECT_EQ(error->code(), 34);
-    EXPECT_EQ(messageOf(error), "Failed to write metadata dictionary to URL " + row.url.path());
+  // Failed writes give code 34 with the writer's error, and leave no file.
+  for (const auto& [url, identifier] :
+       {std::pair{KSTFileURL(fakes.scratch.resolve("/nowhere/C"), true), std::string("com.a")},
+        std::pair{containerAt("Data/Application", "BAD"), std::string("com.\xff\xfe")}}) {
+    SCOPED_TRACE(url.path());
+    auto bad = KSTMetadata::initWithUserId(501, uuid, 2, identifier, std::nullopt, url);
+    EXPECT_FALSE(bad->writeMetadataToDiskWithError(&error));
+    EXPECT_TRUE(
+        testing::isError(error, 34, "Failed to write metadata dictionary to URL " + url.path()));
     EXPECT_NE(error->underlyingError(), nullptr);
-    EXPECT_FALSE(fs::exists(metadataPath(row.url)));
+    EXPECT_FALSE(fs::exists(metadataPath(url)));
   }
 }
 
