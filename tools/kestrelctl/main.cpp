@@ -39,8 +39,6 @@ namespace {
 
 using namespace kestrel;
 
-constexpr const char* kServiceName = "com.zorvane.kestreld";
-
 enum ExitStatus {
   kExitSuccess = 0,
   kExitReplyError = 1,
@@ -98,7 +96,7 @@ int runCall(const std::string& address, const std::string& command,
   request.setUint64("Command", index);  // an item may not override the command
 
   const kestrelctl::CallOutcome outcome =
-      kestrelctl::callDaemon(address, kServiceName, request, timeoutSeconds);
+      kestrelctl::callDaemon(address, kKSTServiceName, request, timeoutSeconds);
   if (auto status = callFailure(outcome)) return *status;
   printJson(outcome.reply);
   const std::uint64_t code = outcome.reply.uint64("ReplyError");
@@ -167,7 +165,7 @@ int runNamed(const std::string& address, const kestrelctl::SubcommandInfo& info,
   }
 
   const kestrelctl::CallOutcome outcome =
-      kestrelctl::callDaemon(address, kServiceName, request, timeoutSeconds);
+      kestrelctl::callDaemon(address, kKSTServiceName, request, timeoutSeconds);
   if (auto status = callFailure(outcome)) return *status;
   if (json) printJson(outcome.reply);
   const std::uint64_t code = outcome.reply.uint64("ReplyError");
@@ -238,7 +236,7 @@ int runFsck(const platform::FilesystemRoot& root, const std::string& address, bo
     platform::MessageDictionary probe;
     probe.setUint64("Command", 1);
     const kestrelctl::CallOutcome reached =
-        kestrelctl::callDaemon(address, kServiceName, probe, timeoutSeconds);
+        kestrelctl::callDaemon(address, kKSTServiceName, probe, timeoutSeconds);
     if (reached.kind == kestrelctl::CallOutcome::Kind::Unreachable) {
       std::cerr << "kestrelctl: " << reached.message << " (fsck --offline checks the disk alone)\n";
       return kExitUnreachable;
@@ -251,7 +249,7 @@ int runFsck(const platform::FilesystemRoot& root, const std::string& address, bo
       request.setUint64("UserID", user);
       request.setBoolean("Transient", transient);
       const kestrelctl::CallOutcome outcome =
-          kestrelctl::callDaemon(address, kServiceName, request, timeoutSeconds);
+          kestrelctl::callDaemon(address, kKSTServiceName, request, timeoutSeconds);
       if (outcome.kind != kestrelctl::CallOutcome::Kind::Reply) {
         *error = outcome.message;
         return std::nullopt;
@@ -353,7 +351,7 @@ int run(int argc, char** argv) {
   const platform::FilesystemRoot filesystemRoot =
       root.empty() ? platform::FilesystemRoot::fromEnvironment() : platform::FilesystemRoot(root);
   if (address.empty()) {
-    address = "unix:path=" + platform::messageServiceSocketPath(filesystemRoot, kServiceName);
+    address = "unix:path=" + platform::messageServiceSocketPath(filesystemRoot, kKSTServiceName);
   }
   if (resetFirstBoot->parsed()) return runResetFirstBoot(filesystemRoot);
   if (fsck->parsed()) return runFsck(filesystemRoot, address, offline, timeoutSeconds);
