@@ -52,6 +52,10 @@ log="$root/private/var/root/Library/Logs/Kestrel/kestreld.log"
 if grep -q "Got exception" "$log"; then
   echo "the daemon caught exceptions:"; grep "Got exception" "$log"; status=1
 fi
+# Every sweep removes what it finds; nothing may have been put aside in /tmp.
+if [[ -n $(ls -A "$root/tmp") ]]; then
+  echo "death row put items aside in $root/tmp:"; ls -A "$root/tmp"; status=1
+fi
 kill -0 "$pid" 2>/dev/null || { echo "the daemon is gone"; status=1; }
 [[ $status == 0 ]] && echo "load test passed" || echo "load test FAILED"
 exit $status

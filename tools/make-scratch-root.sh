@@ -4,7 +4,8 @@
 set -euo pipefail
 here=$(cd "$(dirname "$0")" && pwd)
 root=${1:-$(mktemp -d /tmp/kestrel-root.XXXXXX)}
-mkdir -p "$root/etc" "$root/private/var/mobile" "$root/private/var/mobile2"
+mkdir -p "$root/etc" "$root/private/var/mobile" "$root/private/var/mobile2" "$root/tmp"
+chmod 1777 "$root/tmp"  # where death row puts what it cannot remove
 chmod 0755 "$root"
 cp "$here/scratch-root/etc/passwd" "$here/scratch-root/etc/group" "$root/etc/"
 chown 501:501 "$root/private/var/mobile"

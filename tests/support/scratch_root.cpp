@@ -23,6 +23,9 @@ ScratchRoot::ScratchRoot() {
   fs::copy_file(seed / "passwd", resolve("/etc/passwd"));
   fs::copy_file(seed / "group", resolve("/etc/group"));
   fs::create_directories(resolve("/private/var/mobile"));
+  // Where death row puts what it cannot remove.
+  fs::create_directories(resolve("/tmp"));
+  fs::permissions(resolve("/tmp"), fs::perms(01777));
   fs::create_directories(resolve("/private/var/mobile2"));
   if (::chown(resolve("/private/var/mobile").c_str(), 501, 501) != 0 ||
       ::chown(resolve("/private/var/mobile2").c_str(), 502, 502) != 0) {

@@ -62,6 +62,36 @@ int removeEntry(const FTSENT* entry) {
   }
 }
 
+// Walks and removes one tree; `failures` counts the errors reported so far.
+// A directory whose descendants were all removed and which is still not
+// empty got new entries during the walk (death row gets arrivals while it is
+// swept): it is walked again, at most `arrivalRetries` times deep.
+int removeTree(const char* path, const TreeRemoveErrorCallback& onItemError, long& failures,
+               int arrivalRetries) {
+  struct stat st {};
+  if (::lstat(path, &st) != 0) return errno;
+  const FtsHandle walk = openWalk(path, FTS_PHYSICAL | FTS_NOCHDIR | FTS_XDEV);
+  if (!walk) return lastError();
+  errno = 0;
+  while (FTSENT* entry = ::fts_read(walk.get())) {
+    if (entry->fts_info == FTS_D) entry->fts_number = failures;
+    int error = removeEntry(entry);
+    if (error == ENOTEMPTY && entry->fts_info == FTS_DP && entry->fts_number == failures &&
+        arrivalRetries > 0) {
+      error = removeTree(entry->fts_accpath, onItemError, failures, arrivalRetries - 1);
+      if (error == ENOENT) error = 0;
+    }
+    if (error != 0) {
+      ++failures;
+      if (!(onItemError && onItemError(entry->fts_path, error))) return error;
+    }
+    errno = 0;
+  }
+  return errno;
+}
+
+constexpr int kArrivalRetries = 4;
+
 // --- Copy ----------------------------------------------------------------------------------
 
 // Extended attributes to copy: all but those that the ACL copy carries
@@ -367,17 +397,8 @@ int writeAtomically(const char* path, std::span<const std::uint8_t> contents,
 }  // namespace
 
 int treeRemove(const char* path, const TreeRemoveErrorCallback& onItemError) {
-  struct stat st {};
-  if (::lstat(path, &st) != 0) return errno;
-  const FtsHandle walk = openWalk(path, FTS_PHYSICAL | FTS_NOCHDIR | FTS_XDEV);
-  if (!walk) return lastError();
-  errno = 0;
-  while (FTSENT* entry = ::fts_read(walk.get())) {
-    const int error = removeEntry(entry);
-    if (error != 0 && !(onItemError && onItemError(entry->fts_path, error))) return error;
-    errno = 0;
-  }
-  return errno;
+  long failures = 0;
+  return removeTree(path, onItemError, failures, kArrivalRetries);
 }
 
 int makePath(const char* path, mode_t mode) {
