@@ -152,7 +152,7 @@ class RequestReader {
   const MessageValue* present(const char* key) const { return ok_ ? request_.value(key) : nullptr; }
 
   void wrongType(const char* key, const MessageValue& found, const char* expected) {
-    KSTLogTag(kLogError, tag_, "Request key \"%@\" holds a %@, not a %@", key,
+    KSTLogTag(kLogError, tag_, "Request key \"%@\" has type %@, expected %@", key,
               typeName(found.type()), expected);
     fail(kKSTErrorInvalidParameter);
   }

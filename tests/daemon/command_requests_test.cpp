@@ -101,23 +101,23 @@ TEST_F(CommandRequestsTest, BadlyTypedOrOutOfRangeKeyIsRefusedWith38AndLogged) {
     const char* message;  // after "Request key \"<key>\" "
   } rows[] = {
       {DECODER(KSTDecodeCreateOrLookupRequest), "ContainerClass", MessageValue::fromString("2"),
-       "holds a string, not a uint64"},
+       "has type string, expected uint64"},
       {DECODER(KSTDecodeCreateOrLookupRequest), "Identifier", MessageValue::fromUint64(7),
-       "holds a uint64, not a string"},
+       "has type uint64, expected string"},
       {DECODER(KSTDecodeCreateOrLookupRequest), "CreateIfNecessary", MessageValue::fromUint64(1),
-       "holds a uint64, not a boolean"},
+       "has type uint64, expected boolean"},
       {DECODER(KSTDecodeSetInfoValueRequest), "UUID", MessageValue::fromData({1, 2, 3}),
-       "holds a data, not a UUID"},
+       "has type data, expected UUID"},
       {DECODER(KSTDecodeSetInfoValueRequest), "Value", nestedTooDeep(),
        "is nested too deep to read"},
       {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass", MessageValue::fromUint64(3),
-       "holds a uint64, not a int64"},
+       "has type uint64, expected int64"},
       {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass",
        MessageValue::fromInt64(kMax + 1), "holds 2147483648, beyond any protection class"},
       {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass",
        MessageValue::fromInt64(kMin - 1), "holds -2147483649, beyond any protection class"},
       {DECODER(KSTDecodeStageForDeleteRequest), "UserIDsArray", MessageValue::fromDictionary({}),
-       "holds a dictionary, not a array"},
+       "has type dictionary, expected array"},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.message);
@@ -226,9 +226,9 @@ TEST_F(CommandRequestsTest, ReplaceReadsTheOldKeysOnlyWithAnOldUUID) {
 
   request.setUuid("OldContainerUUID", kUuidA);
   EXPECT_FALSE(KSTDecodeReplaceContainerRequest(request, mobileClient(), &code));
-  EXPECT_TRUE(
-      fakes.logging->contains("KSTDecodeReplaceContainerRequest",
-                              "Request key \"OldContainerClass\" holds a string, not a uint64"));
+  EXPECT_TRUE(fakes.logging->contains(
+      "KSTDecodeReplaceContainerRequest",
+      "Request key \"OldContainerClass\" has type string, expected uint64"));
 
   request.setUint64("OldContainerClass", 2);
   code = kKSTSuccess;
