@@ -4,12 +4,10 @@
 #include <sys/ioctl.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <chrono>
 #include <filesystem>
 #include <fstream>
 #include <future>
-#include <thread>
 
 #include "daemon/daemon_state.h"
 #include "daemon/error_codes.h"
@@ -192,26 +190,6 @@ TEST_F(DeathRowTest, MovesToDeathRowGetAHolderEachAndStartASweepWhenAsked) {
   KSTDeathRowQueue()->sync([] {});
   EXPECT_EQ(fakes.keepAlive->totalBegins(), 1u);
   EXPECT_TRUE(namesIn(deathRow()).empty());
-}
-
-TEST_F(DeathRowTest, ConcurrencyMovesArrivingDuringSweepsNeverFailThem) {
-  // An item renamed into its holder after the sweep has read that holder
-  // leaves it non-empty when the sweep comes to remove it.
-  std::atomic<bool> done = false;
-  std::thread mover([&] {
-    for (int i = 0; i < 5000; ++i) {
-      const std::string item = fakes.scratch.resolve("/private/var/items/" + std::to_string(i));
-      fs::create_directories(item);
-      KSTErrorRef error;
-      if (!moveToDeathRow(item, false, &error)) ADD_FAILURE() << testing::messageOf(error);
-    }
-    done = true;
-  });
-  for (int i = 0; !done; ++i) EXPECT_EQ(sweep(), kKSTSuccess) << "sweep " << i;
-  mover.join();
-  EXPECT_EQ(sweep(), kKSTSuccess);
-  EXPECT_TRUE(namesIn(deathRow()).empty());
-  EXPECT_TRUE(namesIn(tmp()).empty());  // removed, not moved aside
 }
 
 TEST_F(DeathRowTest, MoveToDeathRowFailures) {

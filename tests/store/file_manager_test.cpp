@@ -1,7 +1,9 @@
 #include "store/file_manager.h"
 
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sys/acl.h>
+#include <sys/inotify.h>
 #include <sys/stat.h>
 #include <sys/xattr.h>
 #include <unistd.h>
@@ -10,11 +12,13 @@
 #include <filesystem>
 #include <fstream>
 #include <memory>
+#include <thread>
 
 #include "daemon/log.h"
 #include "platform/data_protection.h"
 #include "platform/file_system.h"
 #include "platform/linux/extended_acl_linux.h"
+#include "platform/unique_fd.h"
 #include "support/store_test_helpers.h"
 
 namespace kestrel {
@@ -86,6 +90,38 @@ TEST_F(FileManagerTest, RemovalTakesTheTreeAndItsLockedFilesButNothingItsLinksPo
                                       "Unset UF_IMMUTABLE on " + path("tree/sub/locked")));
   EXPECT_TRUE(fakes.logging->containsMessage("treeremove hit error for " + path("tree/sub/locked") +
                                              " : Operation not permitted"));
+}
+
+TEST_F(FileManagerTest, RemovalTakesWhatArrivesInADirectoryAfterItWasRead) {
+  // The walk reads "holder", then spends a while emptying "holder/slow";
+  // meanwhile an item is renamed into "holder", as items arrive in the
+  // holders of death row while a sweep runs.
+  for (int i = 0; i < 2000; ++i) makeFile("holder/slow/" + std::to_string(i));
+  makeFile("late", "late");
+  const platform::UniqueFd watch(::inotify_init1(IN_CLOEXEC));
+  ASSERT_TRUE(watch);
+  ASSERT_GE(::inotify_add_watch(watch.get(), path("holder").c_str(), IN_CLOSE_NOWRITE), 0);
+  bool arrived = false;
+  std::thread arrival([&] {
+    // The event without a name is "holder" itself, closed once it was read.
+    alignas(inotify_event) char buffer[4096];
+    for (pollfd ready{watch.get(), POLLIN, 0}; ::poll(&ready, 1, 10000) == 1;) {
+      const ssize_t n = ::read(watch.get(), buffer, sizeof buffer);
+      for (ssize_t at = 0; at < n;) {
+        const auto* event = reinterpret_cast<const inotify_event*>(buffer + at);
+        if (event->len == 0) {
+          arrived = ::rename(path("late").c_str(), path("holder/late").c_str()) == 0;
+          return;
+        }
+        at += static_cast<ssize_t>(sizeof(inotify_event) + event->len);
+      }
+    }
+  });
+  KSTErrorRef error;
+  EXPECT_TRUE(manager.removeItemAtURL(url("holder", true), &error)) << messageOf(error);
+  arrival.join();
+  EXPECT_TRUE(arrived);
+  EXPECT_FALSE(fakes.scratch.exists("/holder"));
 }
 
 TEST_F(FileManagerTest, RemovalReportsTheFirstErrorAndGoesOnAndMovesNeedTheirSource) {

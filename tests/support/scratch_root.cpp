@@ -12,10 +12,41 @@ namespace kestrel::testing {
 
 namespace fs = std::filesystem;
 
+namespace {
+
+// A death test's child runs its test again from the start in a new process,
+// and dies without running destructors. Its root goes beneath a directory
+// that the parent's root names here ("<pid>:<path>") and removes with itself.
+constexpr const char* kChildRootsVariable = "KESTREL_TEST_CHILD_ROOTS";
+
+// The directory named by a parent process, or nothing in the parent itself.
+std::string parentsChildRoots() {
+  const char* value = std::getenv(kChildRootsVariable);
+  if (value == nullptr) return {};
+  const std::string_view text(value);
+  const std::size_t colon = text.find(':');
+  if (colon == std::string_view::npos) return {};
+  if (text.substr(0, colon) == std::to_string(::getpid())) return {};
+  return std::string(text.substr(colon + 1));
+}
+
+}  // namespace
+
 ScratchRoot::ScratchRoot() {
-  std::string pattern = (fs::temp_directory_path() / "kestrel-test-XXXXXX").string();
+  const std::string childRoots = parentsChildRoots();
+  fs::path parent = fs::temp_directory_path();
+  if (!childRoots.empty()) {
+    parent = childRoots;
+    fs::create_directories(parent);
+  }
+  std::string pattern = (parent / "kestrel-test-XXXXXX").string();
   if (mkdtemp(pattern.data()) == nullptr) throw std::runtime_error("mkdtemp failed");
   path_ = pattern;
+  if (childRoots.empty() && std::getenv(kChildRootsVariable) == nullptr) {
+    childRoots_ = path_ + ".children";
+    const std::string value = std::to_string(::getpid()) + ":" + childRoots_;
+    ::setenv(kChildRootsVariable, value.c_str(), 1);
+  }
   fs::permissions(path_, fs::perms(0755));
   // The accounts the daemon expects (the same seed the demo uses).
   const fs::path seed = fs::path(KESTREL_SOURCE_DIR) / "tools/scratch-root/etc";
@@ -38,6 +69,10 @@ ScratchRoot::~ScratchRoot() {
   if (keep != nullptr && std::string_view(keep) == "1") return;
   std::error_code ec;
   fs::remove_all(path_, ec);
+  if (!childRoots_.empty()) {
+    fs::remove_all(childRoots_, ec);
+    ::unsetenv(kChildRootsVariable);
+  }
 }
 
 void ScratchRoot::writeFile(std::string_view systemPath, std::string_view contents) const {

@@ -28,6 +28,9 @@ class ScratchRoot {
 
  private:
   std::string path_;
+  // Where the roots of this process's death-test children go, if this root
+  // is the one that removes them.
+  std::string childRoots_;
 };
 
 }  // namespace kestrel::testing
