@@ -4,14 +4,16 @@
 # `kestrelctl fsck` checks the store on disk and against the daemon's cache.
 #
 #   scripts/load-test.sh [seconds] [clients]      # default 20 s, 4 clients
+#   KESTREL_PRESET=tsan scripts/load-test.sh 60   # the daemon under TSan (or asan)
 set -euo pipefail
 cd "$(dirname "$0")/.."
 seconds="${1:-20}"
 clients="${2:-4}"
 scripts/setup.sh
-build_dir=build/release
-cmake --preset release >/dev/null
-cmake --build --preset release --target kestreld kestrelctl kestrel_load_test >/dev/null
+preset="${KESTREL_PRESET:-release}"
+build_dir="build/$preset"
+cmake --preset "$preset" >/dev/null
+cmake --build --preset "$preset" --target kestreld kestrelctl kestrel_load_test >/dev/null
 
 root="$(tools/make-scratch-root.sh)"
 mkdir -p "$root/etc/kestrel/signatures"
@@ -32,14 +34,22 @@ register load com.zorvane.kestrel.load "$build_dir/tools/kestrel_load_test"
 register ctl com.zorvane.kestrelctl "$build_dir/tools/kestrelctl"
 
 socket="$root/run/kestrel/com.zorvane.kestreld"
-KESTREL_ROOT="$root" "$build_dir/kestreld" 2>/dev/null &
+# A sanitizer build writes its reports next to the root, where the end looks.
+reports="$root.sanitizer"
+KESTREL_ROOT="$root" ASAN_OPTIONS="log_path=$reports" \
+  UBSAN_OPTIONS="log_path=$reports:print_stacktrace=1" \
+  TSAN_OPTIONS="log_path=$reports:second_deadlock_stack=1:suppressions=$PWD/tools/tsan.supp" \
+  "$build_dir/kestreld" 2>/dev/null &
 pid=$!
 status=0
-cleanup() {
+stop_daemon() {
   kill -TERM "$pid" 2>/dev/null || true
   wait "$pid" 2>/dev/null || true
+}
+cleanup() {
+  stop_daemon
   # A failed run keeps its root for a look at the store and the log.
-  if [[ $status == 0 ]]; then KESTRELCTL="$build_dir/tools/kestrelctl" tools/remove-scratch-root.sh "$root"; else echo "root kept: $root"; fi
+  if [[ $status == 0 ]]; then KESTRELCTL="$build_dir/tools/kestrelctl" tools/remove-scratch-root.sh "$root"; rm -f "$reports".*; else echo "root kept: $root"; fi
 }
 trap cleanup EXIT
 for _ in $(seq 200); do [[ -S "$socket" ]] && break; sleep 0.05; done
@@ -57,5 +67,9 @@ if [[ -n $(ls -A "$root/tmp") ]]; then
   echo "death row put items aside in $root/tmp:"; ls -A "$root/tmp"; status=1
 fi
 kill -0 "$pid" 2>/dev/null || { echo "the daemon is gone"; status=1; }
+stop_daemon
+if compgen -G "$reports.*" >/dev/null; then
+  echo "sanitizer reports:"; cat "$reports".*; status=1
+fi
 [[ $status == 0 ]] && echo "load test passed" || echo "load test FAILED"
 exit $status
