@@ -35,10 +35,13 @@ void KSTHandleProcessCodeSigningInfo(KSTCommandContext& context) {
 }
 
 void KSTHandleGetCodeSigningInfo(KSTCommandContext& context) {
-  const std::optional<std::string> identifier = context.request.string("Identifier");
+  auto request = KSTDecodeIdentifierRequest(context.request, context.error);
+  if (!request) return;
   std::optional<PlistDictionary> info;
-  if (identifier)
-    info = KSTCodeSigningMapping::sharedInstance().getCodeSigningInfoForIdentifier(*identifier);
+  if (request->identifier) {
+    info = KSTCodeSigningMapping::sharedInstance().getCodeSigningInfoForIdentifier(
+        *request->identifier);
+  }
   if (!info || !context.reply.setPlist("ReplyInfoDictionary", PlistValue(std::move(*info)))) {
     KSTSetCode(context.error, kKSTErrorNotFound);
   }

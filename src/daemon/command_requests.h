@@ -3,15 +3,15 @@
 //
 // Decoding rules, the same for every command:
 //   - a key that is absent reads as 0 (uint64, int64), false (boolean) or
-//     nothing (string, UUID, property list);
-//   - a key that is present with another type than its command names is bad
-//     input: the request fails with 38 (kKSTErrorInvalidParameter), the log
-//     says which key and which types, and no operation runs;
+//     nothing (string, UUID, array, property list);
+//   - a key that holds another type than its command names reads as absent,
+//     as the message's typed reads do, and the operation then acts as it does
+//     for an absent key; a debug line names the key and both types;
 //   - "UserID" keys keep their low 32 bits and are checked by validateUserId
 //     against the class the command names; a failed check ends the decoding
 //     with 38 (validateUserId logs it);
-//   - the own identifier is the "Identifier" string when the key is present,
-//     else the client's own signing identifier (which may be absent).
+//   - the own identifier is the "Identifier" string when there is one, else
+//     the client's own signing identifier (which may be absent).
 //
 // Each decoder returns nothing, with the code set, when the request cannot
 // be carried out.

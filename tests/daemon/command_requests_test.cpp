@@ -85,12 +85,71 @@ TEST_F(CommandRequestsTest, MissingKeysReadAsTheirDefaultsAndOwnIdentifierFallsB
   EXPECT_EQ(code, kKSTSuccess);
 }
 
-// The decoder of that name for a mobile client of user 501, and its name (the tag it logs with).
-#define DECODER(name)                   \
-#name, [](const MessageDictionary& r, \
-            std::uint64_t* e) { return name(r, mobileClient(), e).has_value(); }
+// A key of another type reads as absent, and the decoder goes on as it does
+// for an absent key; only a debug line tells.
+TEST_F(CommandRequestsTest, WrongTypedKeyReadsAsAbsent) {
+  using Check = std::function<bool(const MessageDictionary&)>;
+  std::uint64_t code = kKSTSuccess;
+  const KSTClientConnection client = mobileClient();
+  struct Row {
+    const char* key;
+    MessageValue value;
+    Check readAsAbsent;  // decodes and holds what an absent key gives
+  } rows[] = {
+      {"ContainerClass", MessageValue::fromString("2"),
+       [&](auto& r) {
+         return KSTDecodeListContainersRequest(r, client, &code)->containerClass == 0;
+       }},
+      {"Identifier", MessageValue::fromUint64(7),
+       [&](auto& r) {
+         return KSTDecodeCreateOrLookupRequest(r, client, &code)->identifier == "com.example.app";
+       }},
+      {"CreateIfNecessary", MessageValue::fromUint64(1),
+       [&](auto& r) {
+         return !KSTDecodeCreateOrLookupRequest(r, client, &code)->createIfNecessary;
+       }},
+      {"UUID", MessageValue::fromData({1, 2, 3}),
+       [&](auto& r) { return !KSTDecodeSetInfoValueRequest(r, client, &code)->uuid; }},
+      {"DataProtectionClass", MessageValue::fromUint64(3),
+       [&](auto& r) {
+         return KSTDecodeDataProtectionRequest(r, client, &code)->dataProtectionClass == 0;
+       }},
+      {"UserIDsArray", MessageValue::fromDictionary({}),
+       [&](auto& r) { return KSTDecodeStageForDeleteRequest(r, client, &code)->userIds.empty(); }},
+      {"OldContainerUUID", MessageValue::fromString("6F1B2C3D-0000-4000-8000-00000000000A"),
+       [&](auto& r) {
+         MessageDictionary replace = r;
+         replace.setUint64("NewContainerClass", 2);
+         replace.setUint64("NewContainerUserID", 501);
+         return !KSTDecodeReplaceContainerRequest(replace, client, &code)->oldContainerUUID;
+       }},
+      {"NumRetryCrashes", MessageValue::fromString("3"),
+       [&](auto& r) { return KSTDecodeRetryTestRequest(r, client, &code)->numRetryCrashes == 0; }},
+      {"Identifier", MessageValue::fromBoolean(true),
+       [&](auto& r) { return !KSTDecodeIdentifierRequest(r, &code)->identifier; }},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.key);
+    MessageDictionary request = classAndUser(2, 501);
+    request.set(row.key, row.value);
+    fakes.logging->clear();
+    code = kKSTSuccess;
+    EXPECT_TRUE(row.readAsAbsent(request));
+    EXPECT_EQ(code, kKSTSuccess);
+    ASSERT_EQ(fakes.logging->lines().size(), 1u);
+    EXPECT_EQ(fakes.logging->lines()[0].level, 7);
+    EXPECT_NE(fakes.logging->lines()[0].message.find("Request key \"" + std::string(row.key) +
+                                                     "\" has type"),
+              std::string::npos);
+  }
+  // A user of the wrong type is user 0, which no check accepts.
+  MessageDictionary request = classAndUser(2, 0);
+  request.setString("UserID", "501");
+  EXPECT_FALSE(KSTDecodeCreateOrLookupRequest(request, client, &code));
+  EXPECT_EQ(code, kKSTErrorInvalidParameter);
+}
 
-TEST_F(CommandRequestsTest, BadlyTypedOrOutOfRangeKeyIsRefusedWith38AndLogged) {
+TEST_F(CommandRequestsTest, UnreadableOrOutOfRangeValueIsRefusedWith38AndLogged) {
   constexpr std::int64_t kMax = std::numeric_limits<std::int32_t>::max();
   constexpr std::int64_t kMin = std::numeric_limits<std::int32_t>::min();
   struct Row {
@@ -100,24 +159,23 @@ TEST_F(CommandRequestsTest, BadlyTypedOrOutOfRangeKeyIsRefusedWith38AndLogged) {
     MessageValue value;
     const char* message;  // after "Request key \"<key>\" "
   } rows[] = {
-      {DECODER(KSTDecodeCreateOrLookupRequest), "ContainerClass", MessageValue::fromString("2"),
-       "has type string, expected uint64"},
-      {DECODER(KSTDecodeCreateOrLookupRequest), "Identifier", MessageValue::fromUint64(7),
-       "has type uint64, expected string"},
-      {DECODER(KSTDecodeCreateOrLookupRequest), "CreateIfNecessary", MessageValue::fromUint64(1),
-       "has type uint64, expected boolean"},
-      {DECODER(KSTDecodeSetInfoValueRequest), "UUID", MessageValue::fromData({1, 2, 3}),
-       "has type data, expected UUID"},
-      {DECODER(KSTDecodeSetInfoValueRequest), "Value", nestedTooDeep(),
-       "is nested too deep to read"},
-      {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass", MessageValue::fromUint64(3),
-       "has type uint64, expected int64"},
-      {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass",
-       MessageValue::fromInt64(kMax + 1), "holds 2147483648, beyond any protection class"},
-      {DECODER(KSTDecodeDataProtectionRequest), "DataProtectionClass",
-       MessageValue::fromInt64(kMin - 1), "holds -2147483649, beyond any protection class"},
-      {DECODER(KSTDecodeStageForDeleteRequest), "UserIDsArray", MessageValue::fromDictionary({}),
-       "has type dictionary, expected array"},
+      {"KSTDecodeSetInfoValueRequest",
+       [](auto& r, auto* e) {
+         return KSTDecodeSetInfoValueRequest(r, mobileClient(), e).has_value();
+       },
+       "Value", nestedTooDeep(), "is nested too deep to read"},
+      {"KSTDecodeDataProtectionRequest",
+       [](auto& r, auto* e) {
+         return KSTDecodeDataProtectionRequest(r, mobileClient(), e).has_value();
+       },
+       "DataProtectionClass", MessageValue::fromInt64(kMax + 1),
+       "holds 2147483648, beyond any protection class"},
+      {"KSTDecodeDataProtectionRequest",
+       [](auto& r, auto* e) {
+         return KSTDecodeDataProtectionRequest(r, mobileClient(), e).has_value();
+       },
+       "DataProtectionClass", MessageValue::fromInt64(kMin - 1),
+       "holds -2147483649, beyond any protection class"},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.message);
@@ -224,11 +282,10 @@ TEST_F(CommandRequestsTest, ReplaceReadsTheOldKeysOnlyWithAnOldUUID) {
   EXPECT_EQ(decoded->newUserId, 501u);
   EXPECT_EQ(decoded->newContainerUUID, kUuidB);
 
+  // With it, the old class of the wrong type is class 0, which takes no user.
   request.setUuid("OldContainerUUID", kUuidA);
   EXPECT_FALSE(KSTDecodeReplaceContainerRequest(request, mobileClient(), &code));
-  EXPECT_TRUE(fakes.logging->contains(
-      "KSTDecodeReplaceContainerRequest",
-      "Request key \"OldContainerClass\" has type string, expected uint64"));
+  EXPECT_TRUE(fakes.logging->containsMessage("Invalid userId 502 for class 0 from client 501"));
 
   request.setUint64("OldContainerClass", 2);
   code = kKSTSuccess;
