@@ -57,9 +57,9 @@ std::unique_ptr<KSTClientConnection> checkEntitlementsAndInitClientObject(
     KSTLog(kLogError, "Failed to copy signing ID for pid %d : %@", pid, identity.error);
   }
 
-  // 2-3.
+  // 2-3. An empty dictionary grants nothing: such a peer has no entitlements at all.
   bool admitted = entitlementIsNone;
-  if (!identity.entitlements) {
+  if (!identity.entitlements || identity.entitlements->empty()) {
     if (!entitlementIsNone) {
       KSTLog(kLogError, "connection attempt from pid %d (%@) missing required entitlement: %s", pid,
              bundleId, entitlement);

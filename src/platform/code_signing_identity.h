@@ -14,7 +14,8 @@ namespace kestrel::platform {
 struct CodeSigningIdentityResult {
   // Absent when it could not be read; error then says why.
   std::optional<std::string> signingIdentifier;
-  // Absent when the peer has no entitlements at all.
+  // Absent when the peer has no entitlements at all (admission takes an
+  // empty dictionary the same way).
   std::optional<PlistDictionary> entitlements;
   std::string error;
 };

@@ -25,6 +25,17 @@ TEST_F(EndToEndTest, ClientsAreAnsweredOrRefusedByTheirRegisteredEntitlements) {
 
   auto plain = call("plain-client", {"25", "UserID=u64:501"});
   EXPECT_EQ(plain.exitStatus, 4) << plain.output;  // refused: the connection is closed
+  // Its Entitlements dictionary is empty: no entitlements at all, not even for command 0.
+  EXPECT_EQ(ctl("plain-client", {"create", "--class", "2", "--user", "501"}).exitStatus, 4);
+
+  // A key of the wrong type reads as absent: an "Identifier" number names no
+  // identifier, so the client's own is used.
+  auto ownIdentifier = call("allowed-client", {"0", "ContainerClass=u64:2", "UserID=u64:501",
+                                               "CreateIfNecessary=bool:true", "Identifier=u64:5"});
+  EXPECT_EQ(ownIdentifier.exitStatus, 0) << ownIdentifier.output;
+  EXPECT_NE(ownIdentifier.output.find("\"ReplyIdentifier\": \"com.example.installer\""),
+            std::string::npos)
+      << ownIdentifier.output;
 
   auto badUser = call("allowed-client", {"25", "UserID=u64:0"});
   EXPECT_EQ(badUser.exitStatus, 1) << badUser.output;

@@ -54,6 +54,7 @@ class RequestDispatchTest : public ::testing::Test {
 
 TEST_F(RequestDispatchTest, AdmissionFollowsTheEntitlements) {
   const PlistDictionary none;
+  const PlistDictionary unrelated{{"com.example.entitlement", true}};
   const PlistDictionary allowed{{kKSTEntitlementAllowed, true}};
   const PlistDictionary allowedAsString{{kKSTEntitlementAllowed, "true"}};
   const PlistDictionary wipeArray{{kKSTEntitlementWipeContainer, PlistArray{"com.a", 5, "com.b"}}};
@@ -72,7 +73,8 @@ TEST_F(RequestDispatchTest, AdmissionFollowsTheEntitlements) {
   }
   const Row rows[] = {
       {"no entitlements at all", std::nullopt, {}},
-      {"empty entitlements", none, noneCommands},
+      {"an empty dictionary is no entitlements", none, {}},
+      {"entitlements but no Kestrel key", unrelated, noneCommands},
       {"allowed", allowed, allowedCommands},
       {"allowed of the wrong type", allowedAsString, noneCommands},
       {"wipe array", wipeArray, {0, 11, 13, 15, 16, 17}},
@@ -116,7 +118,7 @@ TEST_F(RequestDispatchTest, AdmittedClientCarriesItsIdentityAndRights) {
   connect(501, std::nullopt);
   EXPECT_EQ(admit(0), nullptr);
   EXPECT_TRUE(fakes.logging->lines().empty());
-  connect(501, PlistDictionary{}, std::nullopt);
+  connect(501, PlistDictionary{{"com.example.entitlement", true}}, std::nullopt);
   client = admit(0);
   ASSERT_NE(client, nullptr);
   EXPECT_FALSE(client->clientBundleIdentifier().has_value());

@@ -1,7 +1,7 @@
 // A scratch root prepared for the real daemon: a registry of signatures with
 // two copies of kestrelctl, "allowed-client" (entitlement "allowed") and
-// "plain-client" (no Kestrel entitlement), and a way to call the daemon as
-// either. The root's first-boot mark goes with it.
+// "plain-client" (an empty Entitlements dictionary: no entitlements at all),
+// and a way to call the daemon as either. The root's first-boot mark goes with it.
 #pragma once
 
 #include <gtest/gtest.h>
