@@ -18,8 +18,12 @@ inline constexpr const char* kProtectionClassAttribute = "trusted.kestrel.protec
 // attribute holds something that is not a class).
 int getProtectionClass(int fd, std::optional<std::int32_t>* protectionClass);
 
-// Changes the class of the open file or directory fd. Fails with EPERM while
-// the key bag reports the device locked.
+// Class 1: the contents can be read only while the device is unlocked.
+inline constexpr std::int32_t kProtectionClassCompleteUntilUnlock = 1;
+
+// Changes the class of the open file or directory fd. While the key bag
+// reports the device locked, a change into or out of class 1 fails with EPERM;
+// every other change goes through (so containers can be made while locked).
 int setProtectionClass(int fd, std::int32_t protectionClass);
 
 // Gives a file that was just created, and holds nothing yet, its class. A file

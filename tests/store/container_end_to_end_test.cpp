@@ -70,6 +70,13 @@ TEST_F(ContainerEndToEndTest, AppGetsItsOwnContainersAndTheInstallerListsThem) {
   EXPECT_EQ(own.exitStatus, 1);
   EXPECT_NE(own.output.find("error 55"), std::string::npos) << own.output;
   EXPECT_NE(log().find("com.example.app not entitled for a system container"), std::string::npos);
+
+  // A locked device still gets new containers: class 0 holds no keys that locking takes away.
+  scratch.writeFile("/run/kestrel/lock-state", "1\n");
+  auto locked = ctl("allowed-client", {"create", "--class", "2", "--user", "501", "--identifier",
+                                       "com.example.while-locked"});
+  EXPECT_EQ(locked.exitStatus, 0) << locked.output;
+  EXPECT_EQ(fact(locked.output, "existed"), "no");
   EXPECT_EQ(daemon.stop(), 0);
 }
 

@@ -1,8 +1,11 @@
 #include <gtest/gtest.h>
+#include <sys/xattr.h>
 
 #include <filesystem>
 #include <thread>
 
+#include "daemon/client_connection.h"
+#include "daemon/error_codes.h"
 #include "daemon/log.h"
 #include "store/container_class.h"
 #include "store/global_configuration.h"
@@ -95,10 +98,26 @@ TEST_F(LayoutTest, MissingAccountsGiveNoMobileUserAndNoHome) {
   EXPECT_TRUE(fakes.logging->containsMessage("Failed to getpwuid for uid: 503"));
   EXPECT_FALSE(configuration->userBaseDirectory());
   EXPECT_FALSE(global().containerDirectoryURLForUser(503, 2, true));
-  // Kept: the account is not looked up again.
-  fakes.logging->clear();
+
+  // A home that does not resolve is no home either: nothing is made where it would be.
+  fakes.accounts->addUser("third", 503, 503, "/private/var/third");
+  configuration = global().getPerUserConfigurationForUserId(503);
+  ASSERT_NE(configuration, nullptr);
+  EXPECT_FALSE(configuration->userHomeDirectory());
+  EXPECT_TRUE(loggedStartingWith("Failed to resolve home directory " + sys("/private/var/third")));
+  EXPECT_FALSE(global().containerDirectoryURLForUser(503, 2, false));
+  KSTClientConnection installer(std::string("com.example.installer"), 0, true, std::nullopt);
+  std::uint64_t code = kKSTSuccess;
+  EXPECT_FALSE(installer.createOrLookupContainerForUser(503, "com.example.app", true, 2, false,
+                                                        true, &code));
+  EXPECT_EQ(code, kKSTErrorCacheRebuildFailed);
+  EXPECT_FALSE(fs::exists(sys("/private/var/third")));
+  // Neither is kept: once the home is there, the next call finds it.
+  fs::create_directories(sys("/private/var/third"));
+  configuration = global().getPerUserConfigurationForUserId(503);
+  ASSERT_TRUE(configuration->userHomeDirectory());
   EXPECT_EQ(global().getPerUserConfigurationForUserId(503), configuration);
-  EXPECT_FALSE(fakes.logging->containsMessage("Failed to getpwuid for uid: 503"));
+  EXPECT_TRUE(global().containerDirectoryURLForUser(503, 2, false));
 }
 
 TEST_F(LayoutTest, HomeDirectoryIsResolvedAndAskingAboutItMakesNothing) {
@@ -160,9 +179,12 @@ TEST_F(LayoutTest, DirectoriesThatCannotBeMadeAreLoggedAndStillNamed) {
   EXPECT_TRUE(
       loggedStartingWith("Failed to create container dir at \"" + shared + "/Data/System\": "));
 
-  // The class of the caches directory cannot be set while locked.
-  fakes.keyBag->setLockState(1);
+  // The caches directory cannot leave class 1 while locked.
   const std::string caches = sys("/private/var/root/Library/Caches/com.zorvane.kestreld");
+  fs::create_directories(caches);
+  const char classOne[4] = {1, 0, 0, 0};
+  ASSERT_EQ(::setxattr(caches.c_str(), "trusted.kestrel.protection-class", classOne, 4, 0), 0);
+  fakes.keyBag->setLockState(1);
   EXPECT_EQ(global().stagingDirectory().path(), caches + "/Staging");
   EXPECT_TRUE(loggedStartingWith("Failed to create cache dir at \"" + caches + "\": "));
   EXPECT_TRUE(fs::is_directory(caches + "/Staging"));

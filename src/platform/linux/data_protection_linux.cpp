@@ -46,7 +46,14 @@ int getProtectionClass(int fd, std::optional<std::int32_t>* protectionClass) {
 }
 
 int setProtectionClass(int fd, std::int32_t protectionClass) {
-  if (deviceIsLocked()) return EPERM;
+  if (deviceIsLocked()) {
+    // Only class 1 has keys that go away while locked: an item cannot enter
+    // or leave it then. Every other change goes through.
+    if (protectionClass == kProtectionClassCompleteUntilUnlock) return EPERM;
+    std::optional<std::int32_t> current;
+    if (const int error = getProtectionClass(fd, &current); error != 0) return error;
+    if (current == kProtectionClassCompleteUntilUnlock) return EPERM;
+  }
   return writeClass(fd, protectionClass);
 }
 
