@@ -55,7 +55,11 @@ std::shared_ptr<KSTPerUserConfiguration> KSTGlobalConfiguration::perUserConfigur
   }
   std::shared_ptr<KSTPerUserConfiguration> configuration =
       KSTPerUserConfiguration::initWithUserId(userId);
-  if (configuration) perUserConfigurations_.emplace(userId, configuration);
+  // One without a home is not kept either: the account or its home may
+  // appear later, and the next call looks again.
+  if (configuration && configuration->userHomeDirectory()) {
+    perUserConfigurations_.emplace(userId, configuration);
+  }
   return configuration;
 }
 

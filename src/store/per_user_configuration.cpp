@@ -17,15 +17,15 @@ namespace kestrel {
 
 namespace {
 
-// The home directory with every symbolic link resolved. A home that cannot be
-// resolved (it does not exist yet) is kept as the account database gives it,
-// so that asking whether it exists answers no instead of naming another place.
-KSTFileURL resolvedHomeDirectory(const std::string& home, std::uint32_t userId) {
+// The home directory with every symbolic link resolved. A home that cannot
+// be resolved (it does not exist, or a component cannot be read) is no home:
+// nothing is made outside a home that exists.
+std::optional<KSTFileURL> resolvedHomeDirectory(const std::string& home, std::uint32_t userId) {
   std::array<char, PATH_MAX> resolved{};
   if (::realpath(home.c_str(), resolved.data()) == nullptr) {
     KSTLogTag(kLogError, "initWithUserId", "Failed to resolve home directory %s for uid: %u: %s",
               home, userId, std::strerror(errno));
-    return KSTFileURL(home, true);
+    return std::nullopt;
   }
   return KSTFileURL(resolved.data(), true);
 }

@@ -3,10 +3,11 @@
 // the user's home directory from the account database.
 //
 // Made by KSTGlobalConfiguration::getPerUserConfigurationForUserId and kept for
-// the life of the process. Every getter holds this configuration's lock_,
-// which ranks below the global configuration's lock (see
-// global_configuration.h). A configuration whose account could not be found
-// has no home directory, and every directory derived from it is nullopt.
+// the life of the process once it has a home. Every getter holds this
+// configuration's lock_, which ranks below the global configuration's lock
+// (see global_configuration.h). A configuration whose account could not be
+// found, or whose home directory does not resolve, has no home directory, and
+// every directory derived from it is nullopt.
 #pragma once
 
 #include <cstdint>
@@ -26,8 +27,9 @@ class KSTPerUserConfiguration {
   };
 
  public:
-  // nullptr for an id of 500 or below (logged). Without an account, a
-  // configuration without home directory (logged as well).
+  // nullptr for an id of 500 or below (logged). Without an account or with a
+  // home that does not resolve, a configuration without home directory
+  // (logged as well).
   static std::shared_ptr<KSTPerUserConfiguration> initWithUserId(std::uint32_t userId);
 
   KSTPerUserConfiguration(PrivateTag, std::uint32_t userId,
