@@ -107,5 +107,11 @@ inline void KSTSetError(KSTErrorRef* out, KSTErrorRef error) {
 #define KST_ERROR(code, underlying, log, format, ...)                                         \
   ::kestrel::KSTCreateError(__func__, __LINE__, ::kestrel::kKSTErrorDomain, (code), (underlying), \
                             nullptr, (log), (format)__VA_OPT__(, ) __VA_ARGS__)
+// KST_ERROR_IN(function, code, underlying, log, format, args...): the same, built by a
+// helper on behalf of the operation named `function`, whose name the error and its
+// log line carry.
+#define KST_ERROR_IN(function, code, underlying, log, format, ...)                      \
+  ::kestrel::KSTCreateError((function), __LINE__, ::kestrel::kKSTErrorDomain, (code), \
+                            (underlying), nullptr, (log), (format)__VA_OPT__(, ) __VA_ARGS__)
 #define KST_POSIX_ERROR(errnum, format, ...) \
   ::kestrel::KSTCreatePOSIXError(__func__, __LINE__, (errnum), (format)__VA_OPT__(, ) __VA_ARGS__)

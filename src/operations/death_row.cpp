@@ -20,6 +20,7 @@ namespace kestrel {
 namespace {
 
 constexpr const char* kTempDirectory = "/tmp";
+constexpr const char* kRemoveOrMoveTag = "_removeItemOrMoveToTempAtURL";
 // Holders a move tries before it gives up on sweeps taking them away.
 constexpr int kHolderAttempts = 8;
 
@@ -32,14 +33,20 @@ bool removeItemOrMoveToTemp(const KSTFileURL& url, KSTErrorRef* error) {
   if (fileManager.removeItemAtURL(url, &removeError)) return true;
   if (removeError && removeError->isPOSIXError(ENOENT)) return true;
 
-  KSTLogTag(kLogDebug, "_removeItemOrMoveToTempAtURL",
-            "Couldn't remove, so moving item to /tmp: %@ : %@", url, removeError);
+  KSTLogTag(kLogDebug, kRemoveOrMoveTag, "Couldn't remove, so moving item to /tmp: %@ : %@", url,
+            removeError);
+  // Under its own name, in a holder of its own: items put aside by earlier
+  // sweeps never stand in the way.
   const KSTFileURL temp(platform::services().root.resolve(kTempDirectory), true);
-  const KSTFileURL destination = temp.appending(url.lastPathComponent(), url.isDirectory());
   KSTErrorRef moveError;
-  if (fileManager.moveItemAtURL(url, destination, &moveError)) return true;
-  KSTSetError(error, KST_ERROR(kKSTErrorMoveToTempFailed, moveError, true,
-                               "Failed to move dir: %@ to: %@", url, temp));
+  if (const std::optional<KSTFileURL> holder =
+          fileManager.createTemporaryDirectoryInDirectoryURL(temp, &moveError)) {
+    const KSTFileURL destination = holder->appending(url.lastPathComponent(), url.isDirectory());
+    if (fileManager.moveItemAtURL(url, destination, &moveError)) return true;
+    fileManager.removeItemAtURL(*holder, nullptr);
+  }
+  KSTSetError(error, KST_ERROR_IN(kRemoveOrMoveTag, kKSTErrorMoveToTempFailed, moveError, true,
+                                  "Failed to move dir: %@ to: %@", url, temp));
   return false;
 }
 

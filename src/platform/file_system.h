@@ -47,16 +47,22 @@ int copyTree(const char* from, const char* to);
 
 // --- File flags ----------------------------------------------------------------------------
 
-// The user-immutable flag: the file cannot be changed, renamed or unlinked
-// while it is set (FS_IMMUTABLE_FL).
+// The immutable flag: the file cannot be changed, renamed or unlinked while it
+// is set (FS_IMMUTABLE_FL).
 inline constexpr std::uint32_t kFileFlagUserImmutable = 0x2;
+// The append-only flag: the file can only grow; it cannot be renamed or
+// unlinked, and nothing can be removed from a directory that has it
+// (FS_APPEND_FL).
+inline constexpr std::uint32_t kFileFlagAppend = 0x4;
+// Either flag keeps an item (or, on a directory, its entries) from going.
+inline constexpr std::uint32_t kFileFlagsPreventingRemoval = kFileFlagUserImmutable | kFileFlagAppend;
 
 // The file flags of path, without following a symbolic link.
 int lstatFileFlags(const char* path, std::uint32_t* flags);
 
 // Sets the file flags of path to flags, without following a symbolic link.
-// Only kFileFlagUserImmutable is known; only regular files and directories
-// carry flags (EOPNOTSUPP for anything else).
+// Only kFileFlagUserImmutable and kFileFlagAppend are known; only regular
+// files and directories carry flags (EOPNOTSUPP for anything else).
 int lchflags(const char* path, std::uint32_t flags);
 
 // --- Whole files ---------------------------------------------------------------------------

@@ -8,6 +8,7 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <memory>
 #include <string>
 #include <system_error>
@@ -20,6 +21,8 @@
 namespace kestrel {
 
 namespace {
+
+namespace fs = std::filesystem;
 
 constexpr const char* kMetadataFileName = ".com.zorvane.kestrel.metadata.plist";
 // Physical walk, no change of working directory, no other file systems.
@@ -49,33 +52,57 @@ struct TreeRemoveContext {
   int errorNumber = 0;
 };
 
-// Called for each item that a removal could not remove. An item that is
-// user-immutable loses the flag and is removed here; every other failure is
-// logged and the first one kept. The removal always goes on.
+constexpr const char* kTreeRemoveCallbackTag = "_treeremove_error_callback";
+
+// Clears the flags that keep an item (or a directory's entries) from going.
+// True when it had some and they are gone.
+bool clearFlagsPreventingRemoval(const char* path) {
+  std::uint32_t flags = 0;
+  if (const int statError = platform::lstatFileFlags(path, &flags); statError != 0) {
+    KSTLogTag(kLogError, kTreeRemoveCallbackTag,
+              "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path, errnoText(statError));
+    return false;
+  }
+  if ((flags & platform::kFileFlagsPreventingRemoval) == 0) return false;
+  if (const int flagError =
+          platform::lchflags(path, flags & ~platform::kFileFlagsPreventingRemoval);
+      flagError != 0) {
+    KSTLogTag(kLogError, kTreeRemoveCallbackTag, "Failed to lchflags %s: %s", path,
+              errnoText(flagError));
+    return false;
+  }
+  KSTLogTag(kLogNotice, kTreeRemoveCallbackTag, "Unset UF_IMMUTABLE on %s", path);
+  return true;
+}
+
+// Removes one item that the walk could not; an immutable directory is left
+// empty by then, or fails here.
+bool removeAgain(const char* path) {
+  if (::unlink(path) == 0 || (errno == EISDIR && ::rmdir(path) == 0)) return true;
+  KSTLogTag(kLogError, kTreeRemoveCallbackTag, "unlink of %s failed: %s", path, errnoText(errno));
+  return false;
+}
+
+// Called for each item that a removal could not remove. An item kept by its
+// own immutable or append-only flag, or by its directory's, loses the flag
+// and is removed here; every other failure is logged and the first one kept.
+// The removal always goes on.
 bool _treeremove_error_callback(const char* path, int reportedError, TreeRemoveContext* context) {
   int error = reportedError;
   if (error == 0) {
-    KSTLog(kLogError, "treeremove hit error for %s but we failed to get the error number", path);
+    KSTLogTag(kLogError, kTreeRemoveCallbackTag,
+              "treeremove hit error for %s but we failed to get the error number", path);
     error = ENOENT;
   }
   if (error != ENOENT) {
-    KSTLog(kLogError, "treeremove hit error for %s : %s", path, errnoText(error));
+    KSTLogTag(kLogError, kTreeRemoveCallbackTag, "treeremove hit error for %s : %s", path,
+              errnoText(error));
     if (error == EPERM) {
-      std::uint32_t flags = 0;
-      if (const int statError = platform::lstatFileFlags(path, &flags); statError != 0) {
-        KSTLog(kLogError, "Failed to stat %s before unsetting UF_IMMUTABLE: %s", path,
-               errnoText(statError));
-      } else if ((flags & platform::kFileFlagUserImmutable) != 0) {
-        if (const int flagError =
-                platform::lchflags(path, flags & ~platform::kFileFlagUserImmutable);
-            flagError != 0) {
-          KSTLog(kLogError, "Failed to lchflags %s: %s", path, errnoText(flagError));
-        } else {
-          KSTLog(kLogNotice, "Unset UF_IMMUTABLE on %s", path);
-          // An immutable directory is left empty by now, or fails below.
-          if (::unlink(path) == 0 || (errno == EISDIR && ::rmdir(path) == 0)) return true;
-          KSTLog(kLogError, "unlink of %s failed: %s", path, errnoText(errno));
-        }
+      if (clearFlagsPreventingRemoval(path)) {
+        if (removeAgain(path)) return true;
+      } else if (const std::string parent = fs::path(path).parent_path().string();
+                 !parent.empty() && clearFlagsPreventingRemoval(parent.c_str())) {
+        if (removeAgain(path)) return true;
       }
     }
   }
@@ -237,17 +264,32 @@ bool KSTFileManager::_moveItemAtURL(const KSTFileURL& url, const KSTFileURL& toU
   }
   if (::rename(url.fileSystemRepresentation(), toURL.fileSystemRepresentation()) == 0) return true;
   const int renameError = errno;
-  if (renameError == EXDEV) {
-    if (!_copyItemAtURL(url, toURL, true, error)) return false;
-    KSTErrorRef removeError;
-    if (!removeItemAtURL(url, &removeError)) {
-      KSTLog(kLogError, "Failed to remove source %@ : %s", url,
-             errnoText(removeError ? static_cast<int>(removeError->code()) : 0));
-    }
-    return true;
-  }
+  if (renameError == EXDEV) return moveAcrossFileSystems(url, toURL, error);
   KSTSetError(error, KST_POSIX_ERROR(renameError, "rename of %@ to %@ failed: %s", url, toURL,
                                      errnoText(renameError)));
+  return false;
+}
+
+bool KSTFileManager::moveAcrossFileSystems(const KSTFileURL& url, const KSTFileURL& toURL,
+                                           KSTErrorRef* error) const {
+  // Like the rename it stands for, a failed move leaves nothing at the
+  // destination: a copy that failed half-way, or whose source could not be
+  // removed, is taken away again. (Of a source that was partly removed, the
+  // part that went is gone: such moves carry items on their way out.)
+  const bool destinationWasFree = itemDoesNotExistAtURL(toURL);
+  const auto removeCopy = [&] {
+    if (destinationWasFree) removeItemAtURL(toURL, nullptr);
+  };
+  if (!_copyItemAtURL(url, toURL, true, error)) {
+    removeCopy();
+    return false;
+  }
+  KSTErrorRef removeError;
+  if (removeItemAtURL(url, &removeError)) return true;
+  KSTLogTag(kLogError, "_moveItemAtURL", "Failed to remove source %@ : %s", url,
+            errnoText(static_cast<int>(removeError->code())));
+  removeCopy();
+  KSTSetError(error, std::move(removeError));
   return false;
 }
 

@@ -71,8 +71,10 @@ class KSTFileManager {
   bool copyItemIfExistsAtURL(const KSTFileURL& url, const KSTFileURL& toURL,
                              KSTErrorRef* error) const;
 
-  // Renames; across file systems, copies and then removes the source (a
-  // source that cannot be removed is logged, and the move still succeeds).
+  // Renames; across file systems, copies and then removes the source. A move
+  // that fails leaves nothing at the destination: a partial copy, or the copy
+  // of a source that could not be removed (logged; the removal's error is the
+  // move's), is removed again.
   bool _moveItemAtURL(const KSTFileURL& url, const KSTFileURL& toURL, bool failIfSrcMissing,
                       KSTErrorRef* error) const;
   bool moveItemAtURL(const KSTFileURL& url, const KSTFileURL& toURL, KSTErrorRef* error) const;
@@ -135,6 +137,8 @@ class KSTFileManager {
 
  private:
   KSTFileManager() = default;
+  bool moveAcrossFileSystems(const KSTFileURL& url, const KSTFileURL& toURL,
+                             KSTErrorRef* error) const;
 };
 
 }  // namespace kestrel

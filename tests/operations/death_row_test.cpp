@@ -11,9 +11,11 @@
 
 #include "daemon/daemon_state.h"
 #include "daemon/error_codes.h"
+#include "platform/file_system.h"
 #include "platform/unique_fd.h"
 #include "store/global_configuration.h"
 #include "support/store_test_helpers.h"
+#include "support/tmpfs_mount.h"
 
 namespace kestrel {
 namespace {
@@ -23,14 +25,14 @@ using namespace std::chrono_literals;
 using testing::namesIn;
 using Strings = std::vector<std::string>;
 
-// Sets or clears the append-only flag: even root cannot unlink such a file,
-// and removal only knows how to lift the immutable flag.
-int setAppendOnly(const std::string& path, bool on) {
+// Sets the append-only flag: a file that has it cannot be renamed or unlinked
+// until it is cleared.
+int setAppendOnly(const std::string& path) {
   platform::UniqueFd fd(::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
   if (!fd) return errno;
   int flags = 0;
   if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags) != 0) return errno;
-  flags = on ? (flags | FS_APPEND_FL) : (flags & ~FS_APPEND_FL);
+  flags |= FS_APPEND_FL;
   return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags) != 0 ? errno : 0;
 }
 
@@ -39,12 +41,6 @@ class DeathRowTest : public testing::StoreTest {
   ~DeathRowTest() override {
     // Nothing of a sweep may run on once the fakes are gone.
     KSTDeathRowQueue()->sync([] {});
-    // The scratch root cannot go while a file in it is append-only, wherever it was moved.
-    std::error_code ec;
-    for (auto it = fs::recursive_directory_iterator(fakes.scratch.path(), ec);
-         stuck_ && !ec && it != fs::recursive_directory_iterator(); it.increment(ec)) {
-      if (it->path().filename() == "stuck.db") setAppendOnly(it->path().string(), false);
-    }
   }
   static std::string deathRow() {
     return KSTGlobalConfiguration::sharedInstance().deathrowDirectory().path();
@@ -55,13 +51,17 @@ class DeathRowTest : public testing::StoreTest {
     std::ofstream(path + "/Library/Preferences/a.plist") << "a";
     std::ofstream(path + "/Documents") << "b";
   }
-  // A tree that removal cannot take away: it holds an append-only file.
-  void makeStuckTree(const std::string& path) {
+  // A tree that no removal can take away: a file system is mounted in it.
+  testing::TmpfsMount& makeStuckTree(const std::string& path) {
     makeTree(path);
-    std::ofstream(path + "/Library/stuck.db") << "c";
-    const int status = setAppendOnly(path + "/Library/stuck.db", true);
-    if (status != 0) GTEST_SKIP() << "append-only flag not supported here: " << status;
-    stuck_ = true;
+    auto& mount = mounts_.emplace_back(std::make_unique<testing::TmpfsMount>(path + "/Library/mnt"));
+    if (!mount->mounted()) ADD_FAILURE() << "cannot mount: " << mount->error();
+    return *mount;
+  }
+  // A tmpfs on the root's /tmp, as on most Linux systems.
+  void mountTmp() {
+    auto& mount = mounts_.emplace_back(std::make_unique<testing::TmpfsMount>(tmp()));
+    if (!mount->mounted()) ADD_FAILURE() << "cannot mount: " << mount->error();
   }
   std::uint64_t sweep() {
     auto done = std::make_shared<std::promise<std::uint64_t>>();
@@ -87,7 +87,8 @@ class DeathRowTest : public testing::StoreTest {
   }
 
  private:
-  bool stuck_ = false;
+  // Unmounted before the scratch root goes.
+  std::vector<std::unique_ptr<testing::TmpfsMount>> mounts_;
 };
 
 TEST_F(DeathRowTest, SweepEmptiesDeathRowUnderATransactionOnTheBackgroundQueue) {
@@ -119,16 +120,71 @@ TEST_F(DeathRowTest, SweepEmptiesDeathRowUnderATransactionOnTheBackgroundQueue) 
   EXPECT_EQ(fakes.keepAlive->totalBegins(), 1u);
 }
 
-TEST_F(DeathRowTest, EntryThatCannotBeRemovedGoesToTmp) {
+// /tmp on a file system of its own: an item that was made immutable or
+// append-only loses the flag and goes, and no sweep leaves anything behind.
+TEST_F(DeathRowTest, FlaggedItemsLoseTheirFlagAndGoWithTmpOnAnotherFileSystem) {
+  mountTmp();
+  makeTree(deathRow() + "/0A1B2C3D-UUID");
+  std::ofstream(deathRow() + "/0A1B2C3D-UUID/Library/log.db") << "c";
+  makeTree(deathRow() + "/temp.abcdef/Data");
+  ASSERT_EQ(setAppendOnly(deathRow() + "/0A1B2C3D-UUID/Library/log.db"), 0);
+  ASSERT_EQ(setAppendOnly(deathRow() + "/temp.abcdef/Data/Library"), 0);
+  ASSERT_EQ(platform::lchflags((deathRow() + "/temp.abcdef").c_str(),
+                              platform::kFileFlagUserImmutable),
+            0);
+  EXPECT_EQ(sweep(), kKSTSuccess);
+  EXPECT_TRUE(namesIn(deathRow()).empty());
+  EXPECT_TRUE(namesIn(tmp()).empty());
+  EXPECT_TRUE(fakes.logged("Unset UF_IMMUTABLE on " + deathRow() + "/0A1B2C3D-UUID/Library/log.db",
+                           testing::Match::Exact, "_treeremove_error_callback"));
+  EXPECT_EQ(sweep(), kKSTSuccess);
+}
+
+TEST_F(DeathRowTest, EntryThatCannotBeRemovedGoesToTmpInAHolderOfItsOwn) {
   makeStuckTree(deathRow() + "/stuck");
-  if (IsSkipped()) return;
   makeTree(deathRow() + "/other");
   EXPECT_EQ(sweep(), kKSTSuccess);
   EXPECT_TRUE(namesIn(deathRow()).empty());
-  EXPECT_TRUE(fs::exists(tmp() + "/stuck/Library/stuck.db"));
-  EXPECT_FALSE(fs::exists(tmp() + "/other"));
+  const Strings holders = namesIn(tmp());
+  ASSERT_EQ(holders.size(), 1u);
+  EXPECT_TRUE(fs::is_directory(tmp() + "/" + holders[0] + "/stuck/Library/mnt"));
   EXPECT_TRUE(fakes.logged("Couldn't remove, so moving item to /tmp: " + deathRow() + "/stuck : ",
                            testing::Match::Contains, "_removeItemOrMoveToTempAtURL"));
+  // Another of the same name does not collide with it.
+  makeStuckTree(deathRow() + "/stuck");
+  EXPECT_EQ(sweep(), kKSTSuccess);
+  EXPECT_EQ(namesIn(tmp()).size(), 2u);
+}
+
+// Across file systems an item is copied and its source removed; when the
+// source cannot be removed the move fails and its copy goes again, so every
+// sweep answers alike and nothing piles up in /tmp.
+TEST_F(DeathRowTest, EntryThatCannotBeRemovedNorMovedFailsEverySweepAlikeUntilItCanGo) {
+  mountTmp();
+  makeTree(deathRow() + "/first");
+  testing::TmpfsMount& stuck = makeStuckTree(deathRow() + "/stuck");
+  makeTree(deathRow() + "/last");
+  for (int i = 0; i < 2; ++i) {
+    SCOPED_TRACE(i);
+    EXPECT_EQ(sweep(), kKSTErrorDestroyFailed);
+    EXPECT_EQ(namesIn(deathRow()), Strings{"stuck"});
+    EXPECT_TRUE(namesIn(tmp()).empty());
+  }
+  EXPECT_TRUE(fakes.logged("Failed to destroy item at: " + deathRow() + "/stuck"));
+
+  // Alone, it fails with the move's error, which is the failed removal of its source.
+  KSTErrorRef error;
+  const std::string path = deathRow() + "/stuck";
+  EXPECT_FALSE(installer._removeItemOrMoveToTempAtURL(KSTFileURL(path, true), &error));
+  EXPECT_TRUE(testing::isError(error, kKSTErrorMoveToTempFailed,
+                               "Failed to move dir: " + path + " to: " + tmp()));
+  EXPECT_TRUE(testing::isPOSIXError(error->underlyingError(), EBUSY));
+  EXPECT_TRUE(namesIn(tmp()).empty());
+
+  // The next sweep takes it once it can go.
+  stuck.unmount();
+  EXPECT_EQ(sweep(), kKSTSuccess);
+  EXPECT_TRUE(namesIn(deathRow()).empty());
 }
 
 TEST_F(DeathRowTest, EntryThatCanNeitherBeRemovedNorMovedFailsTheSweepButNotTheOthers) {
@@ -136,25 +192,14 @@ TEST_F(DeathRowTest, EntryThatCanNeitherBeRemovedNorMovedFailsTheSweepButNotTheO
   std::ofstream(tmp()) << "/tmp is a file here";
   makeTree(deathRow() + "/first");
   makeStuckTree(deathRow() + "/stuck");
-  if (IsSkipped()) return;
   makeTree(deathRow() + "/last");
   std::ofstream(deathRow() + "/loose") << "x";
   EXPECT_EQ(sweep(), kKSTErrorDestroyFailed);
   EXPECT_EQ(namesIn(deathRow()), Strings{"stuck"});
-  EXPECT_TRUE(fakes.logged("Failed to destroy item at: " + deathRow() + "/stuck"));
-
-  // Removing or moving it alone fails with the move's error.
   KSTErrorRef error;
   const std::string stuck = deathRow() + "/stuck";
   EXPECT_FALSE(installer._removeItemOrMoveToTempAtURL(KSTFileURL(stuck, true), &error));
-  EXPECT_TRUE(testing::isError(error, kKSTErrorMoveToTempFailed,
-                               "Failed to move dir: " + stuck + " to: " + tmp()));
   EXPECT_TRUE(testing::isPOSIXError(error->underlyingError(), ENOTDIR));
-
-  // The next sweep finds the entry again, and takes it once it can.
-  setAppendOnly(stuck + "/Library/stuck.db", false);
-  EXPECT_EQ(sweep(), kKSTSuccess);
-  EXPECT_TRUE(namesIn(deathRow()).empty());
 }
 
 TEST_F(DeathRowTest, MovesToDeathRowGetAHolderEachAndStartASweepWhenAsked) {

@@ -20,6 +20,7 @@
 #include "platform/linux/extended_acl_linux.h"
 #include "platform/unique_fd.h"
 #include "support/store_test_helpers.h"
+#include "support/tmpfs_mount.h"
 
 namespace kestrel {
 namespace {
@@ -125,17 +126,23 @@ TEST_F(FileManagerTest, RemovalTakesWhatArrivesInADirectoryAfterItWasRead) {
 }
 
 TEST_F(FileManagerTest, RemovalReportsTheFirstErrorAndGoesOnAndMovesNeedTheirSource) {
-  // An immutable directory: its file cannot go (EPERM, first), then the
-  // directory is left non-empty (ENOTEMPTY, later); the rest is removed.
+  // The entries of an immutable or append-only directory go once it lost the
+  // flag. A mount point cannot go (EBUSY, first), which leaves its directory
+  // non-empty (ENOTEMPTY, later); the rest is removed.
   makeFile("tree/frozen/file");
-  makeFile("tree/other/file");
+  makeFile("tree/appending/file");
   makeImmutable("tree/frozen");
+  ASSERT_EQ(platform::lchflags(path("tree/appending").c_str(), platform::kFileFlagAppend), 0);
+  makeFile("tree/held/mnt/.keep");
+  testing::TmpfsMount mount(path("tree/held/mnt"));
+  ASSERT_TRUE(mount.mounted()) << mount.error();
   KSTErrorRef error;
   EXPECT_FALSE(manager.removeItemAtURL(url("tree", true), &error));
-  EXPECT_TRUE(isPOSIXError(error, EPERM,
-                           "treeremove of " + path("tree") + " failed: Operation not permitted"));
-  EXPECT_FALSE(fakes.scratch.exists("/tree/other"));
-  EXPECT_TRUE(fakes.scratch.exists("/tree/frozen/file"));
+  EXPECT_TRUE(isPOSIXError(error, EBUSY,
+                           "treeremove of " + path("tree") + " failed: Device or resource busy"));
+  EXPECT_FALSE(fakes.scratch.exists("/tree/frozen"));
+  EXPECT_FALSE(fakes.scratch.exists("/tree/appending"));
+  EXPECT_TRUE(fakes.scratch.exists("/tree/held/mnt"));
 
   EXPECT_FALSE(manager.removeItemAtURL(KSTFileURL(), &error));
   EXPECT_TRUE(isPOSIXError(error, EFAULT, "nil url passed to -removeItemAtURL:error:"));
@@ -143,6 +150,43 @@ TEST_F(FileManagerTest, RemovalReportsTheFirstErrorAndGoesOnAndMovesNeedTheirSou
   EXPECT_FALSE(manager.moveItemAtURL(url("never-there"), url("there"), &error));
   EXPECT_EQ(messageOf(error), "rename of " + path("never-there") + " to " + path("there") +
                                   " failed: No such file or directory");
+}
+
+// Across file systems a move is a copy and a removal; a move that fails
+// leaves nothing at the destination.
+TEST_F(FileManagerTest, MoveAcrossFileSystemsSucceedsWholeOrLeavesNothingThere) {
+  testing::TmpfsMount other(path("other"), 256 * 1024);
+  ASSERT_TRUE(other.mounted()) << other.error();
+  makeFile("plain/a", "a");
+  KSTErrorRef error;
+  EXPECT_TRUE(manager.moveItemAtURL(url("plain", true), url("other/plain", true), &error))
+      << messageOf(error);
+  EXPECT_FALSE(fakes.scratch.exists("/plain"));
+  EXPECT_EQ(fakes.scratch.readFile("/other/plain/a"), "a");
+
+  // The copy runs out of room half-way: the part copied goes again.
+  makeFile("big/1", std::string(200 * 1024, 'x'));
+  makeFile("big/2", std::string(200 * 1024, 'y'));
+  EXPECT_FALSE(manager.moveItemAtURL(url("big", true), url("other/big", true), &error));
+  EXPECT_TRUE(isPOSIXError(error, ENOSPC));
+  EXPECT_FALSE(fakes.scratch.exists("/other/big"));
+  EXPECT_TRUE(fakes.scratch.exists("/big/2"));
+
+  // The source cannot be removed: the move fails with that, and its copy goes.
+  makeFile("held/mnt/.keep");
+  testing::TmpfsMount mount(path("held/mnt"));
+  ASSERT_TRUE(mount.mounted()) << mount.error();
+  EXPECT_FALSE(manager.moveItemAtURL(url("held", true), url("other/held", true), &error));
+  EXPECT_TRUE(isPOSIXError(error, EBUSY));
+  EXPECT_FALSE(fakes.scratch.exists("/other/held"));
+  EXPECT_TRUE(fakes.logging->contains("_moveItemAtURL", "Failed to remove source " + path("held") +
+                                                           " : Device or resource busy"));
+  // An item in the way is not taken for a partial copy.
+  makeFile("other/taken/mine", "mine");
+  makeFile("taken/theirs");
+  EXPECT_FALSE(manager.moveItemAtURL(url("taken", true), url("other/taken", true), &error));
+  EXPECT_TRUE(isPOSIXError(error, EEXIST));
+  EXPECT_EQ(fakes.scratch.readFile("/other/taken/mine"), "mine");
 }
 
 TEST_F(FileManagerTest, NewDirectoryGetsModeOwnerAndClassAnExistingOneKeepsItsMode) {

@@ -431,15 +431,16 @@ int lstatFileFlags(const char* path, std::uint32_t* flags) {
   struct statx sx {};
   if (::statx(AT_FDCWD, path, AT_SYMLINK_NOFOLLOW | AT_NO_AUTOMOUNT, 0, &sx) != 0) return errno;
   *flags = 0;
-  if ((sx.stx_attributes_mask & STATX_ATTR_IMMUTABLE) != 0 &&
-      (sx.stx_attributes & STATX_ATTR_IMMUTABLE) != 0) {
-    *flags |= kFileFlagUserImmutable;
-  }
+  const auto has = [&sx](std::uint64_t attribute) {
+    return (sx.stx_attributes_mask & attribute) != 0 && (sx.stx_attributes & attribute) != 0;
+  };
+  if (has(STATX_ATTR_IMMUTABLE)) *flags |= kFileFlagUserImmutable;
+  if (has(STATX_ATTR_APPEND)) *flags |= kFileFlagAppend;
   return 0;
 }
 
 int lchflags(const char* path, std::uint32_t flags) {
-  if ((flags & ~kFileFlagUserImmutable) != 0) return EOPNOTSUPP;
+  if ((flags & ~kFileFlagsPreventingRemoval) != 0) return EOPNOTSUPP;
   struct stat st {};
   if (::lstat(path, &st) != 0) return errno;
   // Opening a device or a FIFO could have effects of its own; links carry no flags.
@@ -448,8 +449,9 @@ int lchflags(const char* path, std::uint32_t flags) {
   if (!fd) return errno;
   int attributes = 0;
   if (::ioctl(fd.get(), FS_IOC_GETFLAGS, &attributes) != 0) return errno;
-  const int wanted = (flags & kFileFlagUserImmutable) != 0 ? attributes | FS_IMMUTABLE_FL
-                                                           : attributes & ~FS_IMMUTABLE_FL;
+  int wanted = attributes & ~(FS_IMMUTABLE_FL | FS_APPEND_FL);
+  if ((flags & kFileFlagUserImmutable) != 0) wanted |= FS_IMMUTABLE_FL;
+  if ((flags & kFileFlagAppend) != 0) wanted |= FS_APPEND_FL;
   if (wanted == attributes) return 0;
   return ::ioctl(fd.get(), FS_IOC_SETFLAGS, &wanted) == 0 ? 0 : errno;
 }
