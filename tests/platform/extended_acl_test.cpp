@@ -16,6 +16,7 @@
 #include "platform/fake/fake_platform.h"
 #include "platform/linux/extended_acl_linux.h"
 #include "support/scratch_root.h"
+#include "support/store_test_helpers.h"
 
 namespace kestrel::platform {
 namespace {
@@ -26,14 +27,8 @@ AccessControlEntry allow(gid_t gid, std::uint32_t permissions, std::uint32_t fla
   return {kACLTagExtendedAllow, permissions, flags, groupMembershipUUID(gid)};
 }
 
-std::string aclText(const std::string& path, acl_type_t type) {
-  const UniquePosixACL acl(acl_get_file(path.c_str(), type));
-  if (!acl) return "<none>";
-  char* text = acl_to_any_text(acl.get(), nullptr, ',', TEXT_NUMERIC_IDS);
-  std::string result = text;
-  acl_free(text);
-  return result;
-}
+using testing::aclText;
+using testing::modeOf;
 
 TEST(ExtendedACLTest, MembershipUUIDIsDerivedFromTheGid) {
   EXPECT_EQ(groupMembershipUUID(499).string(), "4B535447-0000-8000-8000-0000000001F3");
@@ -96,6 +91,8 @@ class LinuxExtendedACLTest : public ::testing::Test {
 TEST_F(LinuxExtendedACLTest, MapsEntriesOntoPosixListsAndKeepsTheRecord) {
   fs::create_directories(path("d"));
   ::chmod(path("d").c_str(), 0750);
+  fs::create_directories(path("open"));
+  ::chmod(path("open").c_str(), 0755);
   std::ofstream(path("f")) << "x";
   ::chmod(path("f").c_str(), 0640);
   struct Row {
@@ -103,27 +100,48 @@ TEST_F(LinuxExtendedACLTest, MapsEntriesOntoPosixListsAndKeepsTheRecord) {
     AccessControlList acl;
     const char* access;
     const char* defaults;
+    bool sticky;
   };
   const Row rows[] = {
       // Read and search only; the default list is removed.
-      {"d", {{allow(499, 0xA, 0)}}, "user::rwx,group::r-x,group:499:r-x,mask::r-x,other::---", ""},
-      // Adding names needs search on Linux; inherit-only reaches only new items.
+      {"d",
+       {{allow(499, 0xA, 0)}},
+       "user::rwx,group::r-x,group:499:r-x,mask::r-x,other::---",
+       "",
+       false},
+      // Adding without delete child: list, search and add, and the sticky bit;
+      // inherit-only reaches only new items.
       {"d",
        {{allow(499, 0x3FFE, 0x160), allow(499, 0x624, 0)}},
-       "user::rwx,group::r-x,group:499:-wx,mask::rwx,other::---",
-       "user::rwx,group::---,group:499:rwx,mask::rwx,other::---"},
+       "user::rwx,group::r-x,group:499:rwx,mask::rwx,other::---",
+       "user::rwx,group::---,group:499:rwx,mask::rwx,other::---",
+       true},
       // Two groups; a file-only inheritance maps as for a file.
       {"d",
        {{allow(499, 0x3FFE, 0x60), allow(501, 0x20, 0x20)}},
-       "user::rwx,group::r-x,group:499:rwx,group:501:-wx,mask::rwx,other::---",
-       "user::rwx,group::---,group:499:rwx,group:501:-w-,mask::rwx,other::---"},
+       "user::rwx,group::r-x,group:499:rwx,group:501:rwx,mask::rwx,other::---",
+       "user::rwx,group::---,group:499:rwx,group:501:-w-,mask::rwx,other::---",
+       true},
+      // Full control again: no sticky bit.
+      {"d",
+       {{allow(499, 0x3FFE, 0)}},
+       "user::rwx,group::r-x,group:499:rwx,mask::rwx,other::---",
+       "",
+       false},
+      // A member never gets less than everyone else.
+      {"open",
+       {{allow(499, 0x2, 0)}},
+       "user::rwx,group::r-x,group:499:r-x,mask::r-x,other::r-x",
+       "",
+       false},
       // Files have no default list; delete child means nothing on a file.
       {"f",
        {{allow(499, 0x3FBE, 0x10)}},
        "user::rw-,group::r--,group:499:rwx,mask::rwx,other::---",
-       nullptr},
+       nullptr,
+       false},
       // An empty list leaves only the mode, and no record.
-      {"f", {}, "user::rw-,group::r--,other::---", nullptr},
+      {"f", {}, "user::rw-,group::r--,other::---", nullptr, false},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(std::string(row.item) + " " + encodeAccessControlList(row.acl));
@@ -132,6 +150,7 @@ TEST_F(LinuxExtendedACLTest, MapsEntriesOntoPosixListsAndKeepsTheRecord) {
     if (row.defaults != nullptr) {
       EXPECT_EQ(aclText(path(row.item), ACL_TYPE_DEFAULT), row.defaults);
     }
+    EXPECT_EQ((modeOf(path(row.item)) & S_ISVTX) != 0, row.sticky);
     AccessControlList read;
     if (row.acl.entries.empty()) {
       EXPECT_EQ(service.getFile(path(row.item).c_str(), kACLTypeExtended, &read), ENOENT);
@@ -140,6 +159,10 @@ TEST_F(LinuxExtendedACLTest, MapsEntriesOntoPosixListsAndKeepsTheRecord) {
       EXPECT_EQ(read, row.acl);
     }
   }
+  // A mode change keeps the sticky bit that the record needs.
+  ASSERT_EQ(set("d", {{allow(499, 0x624, 0)}}), 0);
+  ASSERT_EQ(service.setModeKeepingACL(path("d").c_str(), 0700), 0);
+  EXPECT_EQ(modeOf(path("d")), 01770u);
 }
 
 TEST_F(LinuxExtendedACLTest, ModeChangeKeepsTheGrant) {

@@ -4,6 +4,7 @@
 
 #include <filesystem>
 #include <string>
+#include <vector>
 
 #include "support/registered_clients.h"
 
@@ -77,6 +78,49 @@ TEST_F(ContainerEndToEndTest, AppGetsItsOwnContainersAndTheInstallerListsThem) {
                                        "com.example.while-locked"});
   EXPECT_EQ(locked.exitStatus, 0) << locked.output;
   EXPECT_EQ(fact(locked.output, "existed"), "no");
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
+// What the kernel lets other users do in a system container the daemon made,
+// tried with real processes of those users.
+TEST_F(ContainerEndToEndTest, SystemContainerIsOpenToItsUsersAsTheKernelEnforcesIt) {
+  testing::DaemonProcess daemon(scratch.path());
+  ASSERT_TRUE(daemon.ready());
+  auto made = ctl("app-client", {"system-container", "--identifier", "com.zorvane.egretd"});
+  ASSERT_EQ(made.exitStatus, 0) << made.output;
+  const std::string c = fact(made.output, "path");
+  const std::vector<std::string> member = {"--reuid=499", "--regid=499", "--groups=499"};
+  const std::vector<std::string> mobile = {"--reuid=501", "--regid=501", "--clear-groups"};
+  struct Row {
+    const std::vector<std::string>& who;
+    std::string command;
+    bool succeeds;
+  } rows[] = {
+      {member, "ls -A " + c, true},
+      {member, "touch " + c + "/made-by-member", true},
+      {member, "mkdir " + c + "/dir-by-member", true},
+      {member, "mv " + c + "/made-by-member " + c + "/renamed-by-member", true},  // its own
+      {member, "touch " + c + "/Library/Caches/inside", true},
+      {member, "mv " + c + "/.com.zorvane.kestrel.metadata.plist " + c + "/moved", false},
+      {member, "rm -f " + c + "/.com.zorvane.kestrel.metadata.plist", false},
+      {member, "mv " + c + "/Library " + c + "/Elsewhere", false},
+      {member, "rmdir " + c + "/tmp", false},
+      {mobile, "ls " + c + "/Library", false},
+      {mobile, "touch " + c + "/made-by-mobile", false},
+      {mobile, "mkdir " + c + "/dir-by-mobile", false},
+  };
+  for (const Row& row : rows) {
+    SCOPED_TRACE(row.who[0] + " " + row.command);
+    std::vector<std::string> arguments = row.who;
+    arguments.insert(arguments.end(), {"--", "sh", "-c", row.command});
+    const testing::ProcessResult result = testing::runProcess("/usr/bin/setpriv", arguments);
+    EXPECT_EQ(result.exitStatus == 0, row.succeeds) << result.output;
+  }
+  for (const char* kept : {"/.com.zorvane.kestrel.metadata.plist", "/Library", "/tmp"}) {
+    EXPECT_TRUE(fs::exists(c + kept)) << kept;
+  }
+  EXPECT_FALSE(fs::exists(c + "/made-by-mobile"));
+  EXPECT_FALSE(fs::exists(c + "/dir-by-mobile"));
   EXPECT_EQ(daemon.stop(), 0);
 }
 

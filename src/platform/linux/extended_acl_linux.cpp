@@ -142,6 +142,40 @@ int setPosixACL(const std::string& path, acl_type_t type, const PosixGrants& gra
   return 0;
 }
 
+// Sets or clears a directory's sticky bit, keeping the rest of its mode (whose
+// group bits are the list's mask).
+int setStickyBit(const OpenedItem& item, bool on) {
+  struct stat st {};
+  if (::fstat(item.fd.get(), &st) != 0) return errno;
+  const mode_t mode = on ? (st.st_mode | S_ISVTX) : (st.st_mode & ~S_ISVTX);
+  if ((mode & 07777) == (st.st_mode & 07777)) return 0;
+  return ::chmod(item.path.c_str(), mode & 07777) == 0 ? 0 : errno;
+}
+
+// The record of the item at path: through a /proc/self/fd path when follow is
+// set, else never following a link at path. ENOENT when there is none.
+int readRecord(const char* path, bool follow, AccessControlList* acl) {
+  const auto get = follow ? ::getxattr : ::lgetxattr;
+  std::string record(256, '\0');
+  for (;;) {
+    const ssize_t size = get(path, kExtendedACLAttribute, record.data(), record.size());
+    if (size >= 0) {
+      record.resize(static_cast<std::size_t>(size));
+      break;
+    }
+    if (errno == ENODATA) return ENOENT;
+    if (errno != ERANGE) return errno;
+    const ssize_t needed = get(path, kExtendedACLAttribute, nullptr, 0);
+    if (needed < 0) return errno == ENODATA ? ENOENT : errno;
+    if (static_cast<std::size_t>(needed) > kMaxRecordSize) return EINVAL;
+    record.resize(static_cast<std::size_t>(needed) + 1);
+  }
+  std::optional<AccessControlList> decoded = decodeAccessControlList(record);
+  if (!decoded) return EINVAL;
+  *acl = std::move(*decoded);
+  return 0;
+}
+
 int writeRecord(const std::string& path, const AccessControlList& acl) {
   if (acl.entries.empty()) {
     if (::removexattr(path.c_str(), kExtendedACLAttribute) != 0 && errno != ENODATA) return errno;
@@ -159,6 +193,11 @@ int writeRecord(const std::string& path, const AccessControlList& acl) {
 LinuxExtendedACL::LinuxExtendedACL(std::shared_ptr<const Accounts> accounts)
     : accounts_(std::move(accounts)) {}
 
+bool LinuxExtendedACL::addsWithoutDeletingChildren(std::uint32_t permissions) {
+  return (permissions & (kACLWriteData | kACLAppendData)) != 0 &&
+         (permissions & kACLDeleteChild) == 0;
+}
+
 unsigned LinuxExtendedACL::posixPermissionsFor(std::uint32_t permissions, bool isDirectory) {
   std::uint32_t writeBits = kACLWriteData | kACLAppendData;
   if (isDirectory) writeBits |= kACLDeleteChild;
@@ -167,6 +206,9 @@ unsigned LinuxExtendedACL::posixPermissionsFor(std::uint32_t permissions, bool i
   if ((permissions & writeBits) != 0) bits |= kPosixWrite;
   if ((permissions & kACLExecute) != 0) bits |= kPosixExecute;
   if (isDirectory && (bits & kPosixWrite) != 0) bits |= kPosixExecute;
+  // Adding without removing is write plus the sticky bit; members list the
+  // names they may add beside, as everyone else may.
+  if (isDirectory && addsWithoutDeletingChildren(permissions)) bits |= kPosixRead;
   return bits;
 }
 
@@ -205,10 +247,12 @@ int LinuxExtendedACL::setFile(const char* path, int type, const AccessControlLis
   // A new item made by a member of a group is owned by that member: the owner
   // class gets what the group inherits. group:: and other:: get nothing.
   PosixGrants inherited;
+  bool sticky = false;
   for (std::size_t i = 0; i < acl.entries.size(); ++i) {
     const AccessControlEntry& entry = acl.entries[i];
     if ((entry.flags & kACLEntryInheritOnly) == 0) {
       access.groups[gids[i]] |= posixPermissionsFor(entry.permissions, isDirectory);
+      sticky = sticky || (isDirectory && addsWithoutDeletingChildren(entry.permissions));
     }
     if (!isDirectory) continue;
     unsigned bits = 0;
@@ -224,8 +268,14 @@ int LinuxExtendedACL::setFile(const char* path, int type, const AccessControlLis
     }
   }
 
+  // An allow entry adds to what the mode grants everyone, but POSIX stops at
+  // the first group entry that matches: a named group keeps what other:: has.
+  for (auto& [gid, bits] : access.groups) bits |= access.other;
   if (const int failure = setPosixACL(item.path, ACL_TYPE_ACCESS, access); failure != 0) {
     return failure;
+  }
+  if (isDirectory) {
+    if (const int failure = setStickyBit(item, sticky); failure != 0) return failure;
   }
   if (isDirectory) {
     if (inherited.groups.empty()) {
@@ -241,24 +291,19 @@ int LinuxExtendedACL::setFile(const char* path, int type, const AccessControlLis
 
 int LinuxExtendedACL::getFile(const char* path, int type, AccessControlList* acl) const {
   if (path == nullptr || acl == nullptr || type != kACLTypeExtended) return EINVAL;
-  std::string record(256, '\0');
-  for (;;) {
-    const ssize_t size = ::lgetxattr(path, kExtendedACLAttribute, record.data(), record.size());
-    if (size >= 0) {
-      record.resize(static_cast<std::size_t>(size));
-      break;
+  return readRecord(path, false, acl);
+}
+
+bool LinuxExtendedACL::recordNeedsStickyBit(const std::string& itemPath) {
+  AccessControlList acl;
+  if (readRecord(itemPath.c_str(), true, &acl) != 0) return false;
+  for (const AccessControlEntry& entry : acl.entries) {
+    if ((entry.flags & kACLEntryInheritOnly) == 0 &&
+        addsWithoutDeletingChildren(entry.permissions)) {
+      return true;
     }
-    if (errno == ENODATA) return ENOENT;
-    if (errno != ERANGE) return errno;
-    const ssize_t needed = ::lgetxattr(path, kExtendedACLAttribute, nullptr, 0);
-    if (needed < 0) return errno == ENODATA ? ENOENT : errno;
-    if (static_cast<std::size_t>(needed) > kMaxRecordSize) return EINVAL;
-    record.resize(static_cast<std::size_t>(needed) + 1);
   }
-  std::optional<AccessControlList> decoded = decodeAccessControlList(record);
-  if (!decoded) return EINVAL;
-  *acl = std::move(*decoded);
-  return 0;
+  return false;
 }
 
 int LinuxExtendedACL::setModeKeepingACL(const char* path, mode_t mode) {
@@ -301,10 +346,12 @@ int LinuxExtendedACL::setModeKeepingACL(const char* path, mode_t mode) {
   if (calculated != 0) return errno;
   if (::acl_set_file(itemPath, ACL_TYPE_ACCESS, current.get()) != 0) return errno;
 
-  // The set-id and sticky bits are not part of the list.
+  // The set-id and sticky bits are not part of the POSIX list; a directory
+  // keeps the sticky bit its record needs.
   struct stat st {};
   if (::fstat(item.fd.get(), &st) != 0) return errno;
-  const mode_t wanted = (mode & 07000) | (st.st_mode & 0777);
+  mode_t wanted = (mode & 07000) | (st.st_mode & 0777);
+  if (S_ISDIR(st.st_mode) && recordNeedsStickyBit(item.path)) wanted |= S_ISVTX;
   if ((st.st_mode & 07777) != wanted && ::chmod(itemPath, wanted) != 0) return errno;
   return 0;
 }

@@ -16,6 +16,15 @@
 //      because Linux lets nobody add or remove a name in a directory that
 //      they cannot search
 //
+//   On a directory, write rights let POSIX members unlink and rename any
+//   name. An entry that adds files or sub-directories but has no delete child
+//   therefore becomes rwx plus the sticky bit on that directory: members
+//   list, search and add, and remove or rename only what they own.
+//
+//   An allow entry only adds to what the mode grants everyone, but POSIX
+//   stops at the first group entry that matches, so a named group also keeps
+//   the bits of other:: (else members would get less than everyone).
+//
 //   Delete (0x10) is decided by the parent directory, and the attribute,
 //   extended-attribute, security and owner bits (0x80-0x2000) by ownership and
 //   capabilities on Linux: they have no rwx counterpart.
@@ -48,6 +57,10 @@
 //     its list is set again.
 //   - Deny entries cannot be expressed: setting a list with one fails with
 //     EOPNOTSUPP. A qualifier that is not a group membership UUID: EINVAL.
+//   - The sticky bit belongs to the directory, not to a POSIX list: it is
+//     set or cleared with each list set on a directory, kept by
+//     setModeKeepingACL(), and never inherited (an inherited add-only entry
+//     reaches new directories as plain write).
 //
 // Every call opens the item with O_PATH | O_NOFOLLOW and works through
 // /proc/self/fd, so that a symbolic link put in place of the item between the
@@ -108,8 +121,13 @@ class LinuxExtendedACL final : public ExtendedACL {
 
   // The rwx bits (4, 2, 1) that the permission bits grant on a file or a directory.
   static unsigned posixPermissionsFor(std::uint32_t permissions, bool isDirectory);
+  // Whether the bits add files or sub-directories without removing any: on a
+  // directory, write plus the sticky bit.
+  static bool addsWithoutDeletingChildren(std::uint32_t permissions);
 
  private:
+  static bool recordNeedsStickyBit(const std::string& itemPath);
+
   std::shared_ptr<const Accounts> accounts_;
 };
 
