@@ -6,7 +6,11 @@
 //             the same kind of connection to the same daemon;
 //   creation  command 0 of new identifiers, against a baseline that makes the
 //             same directories, metadata file (written, synced, renamed),
-//             owners and final rename in-process, without the daemon.
+//             owners and final rename in-process, without the daemon; the
+//             baseline runs twice, alternately, with and without the flushes
+//             that make a creation survive a power loss (every directory of
+//             the new container before the rename, the class directory and
+//             those above it after), which gives the price of durability.
 //
 //   kestrel_request_bench --address unix:path=... --root R --out DIR [--seconds S]
 //                         [--only ping|lookup|reject]
@@ -124,16 +128,21 @@ Phase runTimed(const std::string& name, const std::string& address, int clients,
 // The same system calls as a creation, without the daemon: the staging
 // directory and its five sub-directories with owners, the metadata file
 // written, synced and renamed into place (and its directory synced), and the
-// rename into the class directory.
+// rename into the class directory; when durable, also the flushes of every
+// directory of the new container before that rename and of the class
+// directory and the five above it (up to the root, as for a mobile user's
+// container) after it.
 class SyscallBaseline {
  public:
   explicit SyscallBaseline(const std::string& root)
-      : staging_(root + "/bench-baseline/Staging"), live_(root + "/bench-baseline/Live") {
+      : root_(root),
+        staging_(root + "/bench-baseline/Staging"),
+        live_(root + "/private/var/bench-baseline/Containers/Data/Application") {
     fs::create_directories(staging_);
     fs::create_directories(live_);
   }
 
-  void createOne(std::size_t index) {
+  void createOne(std::size_t index, bool durable) {
     const std::string name = kestrel::platform::Uuid::random().string();
     const std::string top = staging_ + "/" + name;
     mkdirOwned(top);
@@ -150,11 +159,26 @@ class SyscallBaseline {
          {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp"}) {
       mkdirOwned(top + "/" + sub);
     }
+    if (durable) {
+      for (const char* sub :
+           {"Documents", "Library/Caches", "Library/Preferences", "Library", "tmp", ""}) {
+        sync(top + "/" + sub);
+      }
+    }
     if (::rename(top.c_str(), (live_ + "/" + name).c_str()) != 0)
       throw std::runtime_error("rename");
+    if (durable) {
+      for (fs::path directory = live_; directory != root_; directory = directory.parent_path()) {
+        sync(directory);
+      }
+    }
   }
 
  private:
+  static void sync(const fs::path& directory) {
+    kestrel::platform::UniqueFd fd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!fd || ::fsync(fd.get()) != 0) throw std::runtime_error("fsync " + directory.string());
+  }
   static void mkdirOwned(const std::string& path) {
     if (::mkdir(path.c_str(), 0755) != 0 || ::chown(path.c_str(), kUser, kUser) != 0) {
       throw std::runtime_error("mkdir " + path);
@@ -175,6 +199,7 @@ class SyscallBaseline {
     if (directory) ::fsync(directory.get());
   }
 
+  fs::path root_;
   std::string staging_;
   std::string live_;
 };
@@ -284,9 +309,21 @@ int run(int argc, char** argv) {
         throw std::runtime_error("creation failed");
       }
     }));
+    // Alternately, so that both see the same disk and the same neighbours.
     SyscallBaseline baseline(root);
-    phases.push_back(
-        timedLoop("create-syscalls", kCreations, [&](std::size_t i) { baseline.createOne(i); }));
+    Phase plain{"create-syscalls", 1, {}, 0};
+    Phase durable{"create-syscalls-durable", 1, {}, 0};
+    for (std::size_t i = 0; i < kCreations; ++i) {
+      for (Phase* phase : {&plain, &durable}) {
+        const auto t0 = Clock::now();
+        baseline.createOne(2 * i + (phase == &durable ? 1 : 0), phase == &durable);
+        const double micros = std::chrono::duration<double, std::micro>(Clock::now() - t0).count();
+        phase->micros.push_back(micros);
+        phase->seconds += micros / 1e6;
+      }
+    }
+    phases.push_back(std::move(plain));
+    phases.push_back(std::move(durable));
   }
 
   fs::create_directories(out);
@@ -316,8 +353,12 @@ int run(int argc, char** argv) {
     ratios["lookup_p50_over_ping_p50_" + std::to_string(clients) + "_clients"] =
         find("lookup", clients).percentile(0.5) / find("ping", clients).percentile(0.5);
   }
+  // The daemon makes the durable calls, so that is its floor.
   ratios["create_p50_over_syscalls_p50"] =
-      find("create", 1).percentile(0.5) / find("create-syscalls", 1).percentile(0.5);
+      find("create", 1).percentile(0.5) / find("create-syscalls-durable", 1).percentile(0.5);
+  ratios["durable_syscalls_p50_over_plain_syscalls_p50"] =
+      find("create-syscalls-durable", 1).percentile(0.5) /
+      find("create-syscalls", 1).percentile(0.5);
   ratios["lookup_throughput_2_clients_over_1"] =
       find("lookup", 2).throughput() / find("lookup", 1).throughput();
   ratios["lookup_throughput_8_clients_over_1"] =

@@ -76,8 +76,8 @@ KSTErrorRef KSTCreateError(const char* function, int line, std::string_view doma
                             format, std::vector<FormatArg>{FormatArg(std::forward<Args>(args))...});
 }
 
-KSTErrorRef KSTCreatePOSIXErrorArgs(const char* function, int line, int errnum,
-                                    const char* format, const std::vector<FormatArg>& args);
+KSTErrorRef KSTCreatePOSIXErrorArgs(const char* function, int line, int errnum, const char* format,
+                                    const std::vector<FormatArg>& args);
 
 // An error of the POSIX domain whose code is the errno value. Writes no log line.
 template <typename... Args>
@@ -104,13 +104,13 @@ inline void KSTSetError(KSTErrorRef* out, KSTErrorRef error) {
 }  // namespace kestrel
 
 // KST_ERROR(code, underlying, log, format, args...) in domain KSTErrorDomain.
-#define KST_ERROR(code, underlying, log, format, ...)                                         \
+#define KST_ERROR(code, underlying, log, format, ...)                                             \
   ::kestrel::KSTCreateError(__func__, __LINE__, ::kestrel::kKSTErrorDomain, (code), (underlying), \
                             nullptr, (log), (format)__VA_OPT__(, ) __VA_ARGS__)
 // KST_ERROR_IN(function, code, underlying, log, format, args...): the same, built by a
 // helper on behalf of the operation named `function`, whose name the error and its
 // log line carry.
-#define KST_ERROR_IN(function, code, underlying, log, format, ...)                      \
+#define KST_ERROR_IN(function, code, underlying, log, format, ...)                    \
   ::kestrel::KSTCreateError((function), __LINE__, ::kestrel::kKSTErrorDomain, (code), \
                             (underlying), nullptr, (log), (format)__VA_OPT__(, ) __VA_ARGS__)
 #define KST_POSIX_ERROR(errnum, format, ...) \

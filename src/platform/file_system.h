@@ -55,7 +55,8 @@ inline constexpr std::uint32_t kFileFlagUserImmutable = 0x2;
 // (FS_APPEND_FL).
 inline constexpr std::uint32_t kFileFlagAppend = 0x4;
 // Either flag keeps an item (or, on a directory, its entries) from going.
-inline constexpr std::uint32_t kFileFlagsPreventingRemoval = kFileFlagUserImmutable | kFileFlagAppend;
+inline constexpr std::uint32_t kFileFlagsPreventingRemoval =
+    kFileFlagUserImmutable | kFileFlagAppend;
 
 // The file flags of path, without following a symbolic link.
 int lstatFileFlags(const char* path, std::uint32_t* flags);

@@ -115,13 +115,29 @@ class ContainerBuilder {
     *staging =
         KSTGlobalConfiguration::sharedInstance().stagingDirectory().appending(directoryName, true);
     KSTMetadataRef record = buildInStaging(**staging, error);
+    if (record && !synchronizeStaging(**staging, error)) record = nullptr;
     std::optional<KSTFileURL> destination;
     if (record) destination = moveIntoPlace(**staging, directoryName, error);
     if (!destination) {
       *error = retireStaging(client_, **staging, *error);
       return nullptr;
     }
-    return addToCache(record, *destination, error);
+    // In place; what the cache and the caller are told must survive a power
+    // loss, so the class directory (and any directory made above it) is
+    // flushed before either hears of it.
+    KSTErrorRef syncError;
+    const bool durable = KSTFileManager::defaultManager().synchronizeDirectoryAndAncestorsAtURL(
+        destination->deletingLastPathComponent(), &syncError);
+    KSTMetadataRef added = addToCache(record, *destination, error);
+    if (added && !durable) {
+      // Left in place and known to the cache, like any container: asking
+      // again finds it.
+      *error = KST_ERROR_IN("createOrLookupContainerForUser", kKSTErrorMoveStagingFailed, syncError,
+                            true, "Failed to move staging dir: %@ to live dir: %@", **staging,
+                            *destination);
+      return nullptr;
+    }
+    return added;
   }
 
   // Clean-up: the staging directory goes to death row; one that was never
@@ -157,6 +173,17 @@ class ContainerBuilder {
       return nullptr;
     }
     return record;
+  }
+
+  // The whole new container reaches the disk before the rename that makes it
+  // live: its sub-directories, owners, modes and ACLs (its metadata file was
+  // flushed when it was written).
+  static bool synchronizeStaging(const KSTFileURL& staging, KSTErrorRef* error) {
+    KSTErrorRef syncError;
+    if (KSTFileManager::defaultManager().synchronizeTreeAtURL(staging, &syncError)) return true;
+    *error = KST_ERROR_IN("createOrLookupContainerForUser", kKSTErrorCreateStagingFailed, syncError,
+                          true, "Failed to create staging dir at %@ : %@", staging, syncError);
+    return false;
   }
 
   std::optional<KSTFileURL> moveIntoPlace(const KSTFileURL& staging,

@@ -16,6 +16,7 @@
 #include "daemon/log.h"
 #include "platform/data_protection.h"
 #include "platform/file_system.h"
+#include "platform/services.h"
 #include "platform/unique_fd.h"
 
 namespace kestrel {
@@ -430,6 +431,45 @@ bool KSTFileManager::itemDoesNotExistAtURL(const KSTFileURL& url) const {
   if (statError == ENOENT) return true;
   KSTLog(kLogError, "Failed to determine if %@ exists: %s", url, errnoText(statError));
   return false;
+}
+
+namespace {
+
+// 0, or the errno of flushing the directory at path.
+int synchronizeDirectory(const char* path) {
+  const platform::UniqueFd directory(::open(path, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  if (!directory) return errno;
+  return ::fsync(directory.get()) == 0 ? 0 : errno;
+}
+
+}  // namespace
+
+bool KSTFileManager::synchronizeTreeAtURL(const KSTFileURL& url, KSTErrorRef* error) const {
+  return _traverseDirectory(url, error, [](FTSENT* entry, KSTErrorRef* visitorError) {
+    // A directory's second visit comes after everything beneath it.
+    if (entry->fts_info != FTS_DP) return true;
+    if (const int synced = synchronizeDirectory(entry->fts_accpath); synced != 0) {
+      KSTSetError(visitorError, KST_POSIX_ERROR(synced, "fsync of %s failed: %s", entry->fts_path,
+                                                errnoText(synced)));
+      return false;
+    }
+    return true;
+  });
+}
+
+bool KSTFileManager::synchronizeDirectoryAndAncestorsAtURL(const KSTFileURL& url,
+                                                           KSTErrorRef* error) const {
+  const fs::path root = platform::services().root.path();
+  for (fs::path directory = url.path();
+       !directory.empty() && directory != root && directory != directory.root_path();
+       directory = directory.parent_path()) {
+    if (const int synced = synchronizeDirectory(directory.c_str()); synced != 0) {
+      KSTSetError(error, KST_POSIX_ERROR(synced, "fsync of %s failed: %s", directory.string(),
+                                         errnoText(synced)));
+      return false;
+    }
+  }
+  return true;
 }
 
 bool KSTFileManager::standardizeOwnershipAtURL(const KSTFileURL& url, uid_t toUID, gid_t GID,

@@ -102,6 +102,15 @@ class KSTFileManager {
   bool itemExistsAtURL(const KSTFileURL& url) const;
   bool itemDoesNotExistAtURL(const KSTFileURL& url) const;
 
+  // Flushes to disk every directory of the tree at url, each after what lies
+  // beneath it: names, owners, modes and ACLs (what files hold is their
+  // writers' to flush). Stops at the first failure.
+  bool synchronizeTreeAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
+  // Flushes the directory at url and every directory above it up to, not
+  // including, the filesystem root, so that a directory made on the way
+  // stays too.
+  bool synchronizeDirectoryAndAncestorsAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
+
   // Gives every item of the tree (metadata files excepted) the owner and group,
   // and mode 0755 (directories and executables) or 0644.
   bool standardizeOwnershipAtURL(const KSTFileURL& url, uid_t toUID, gid_t GID,

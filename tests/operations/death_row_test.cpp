@@ -54,7 +54,8 @@ class DeathRowTest : public testing::StoreTest {
   // A tree that no removal can take away: a file system is mounted in it.
   testing::TmpfsMount& makeStuckTree(const std::string& path) {
     makeTree(path);
-    auto& mount = mounts_.emplace_back(std::make_unique<testing::TmpfsMount>(path + "/Library/mnt"));
+    auto& mount =
+        mounts_.emplace_back(std::make_unique<testing::TmpfsMount>(path + "/Library/mnt"));
     if (!mount->mounted()) ADD_FAILURE() << "cannot mount: " << mount->error();
     return *mount;
   }
@@ -129,9 +130,9 @@ TEST_F(DeathRowTest, FlaggedItemsLoseTheirFlagAndGoWithTmpOnAnotherFileSystem) {
   makeTree(deathRow() + "/temp.abcdef/Data");
   ASSERT_EQ(setAppendOnly(deathRow() + "/0A1B2C3D-UUID/Library/log.db"), 0);
   ASSERT_EQ(setAppendOnly(deathRow() + "/temp.abcdef/Data/Library"), 0);
-  ASSERT_EQ(platform::lchflags((deathRow() + "/temp.abcdef").c_str(),
-                              platform::kFileFlagUserImmutable),
-            0);
+  ASSERT_EQ(
+      platform::lchflags((deathRow() + "/temp.abcdef").c_str(), platform::kFileFlagUserImmutable),
+      0);
   EXPECT_EQ(sweep(), kKSTSuccess);
   EXPECT_TRUE(namesIn(deathRow()).empty());
   EXPECT_TRUE(namesIn(tmp()).empty());

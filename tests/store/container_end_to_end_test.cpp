@@ -2,7 +2,11 @@
 // identities and rights.
 #include <gtest/gtest.h>
 
+#include <signal.h>
+
+#include <algorithm>
 #include <filesystem>
+#include <fstream>
 #include <string>
 #include <vector>
 
@@ -78,6 +82,61 @@ TEST_F(ContainerEndToEndTest, AppGetsItsOwnContainersAndTheInstallerListsThem) {
                                        "com.example.while-locked"});
   EXPECT_EQ(locked.exitStatus, 0) << locked.output;
   EXPECT_EQ(fact(locked.output, "existed"), "no");
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
+// The system calls of one creation, watched from outside with strace: the
+// whole container reaches the disk before the rename that makes it live, and
+// the class directory after it, before the reply.
+TEST_F(ContainerEndToEndTest, CreationIsOnDiskBeforeItIsAcknowledged) {
+  testing::DaemonProcess daemon(scratch.path());
+  ASSERT_TRUE(daemon.ready());
+  const std::string trace = scratch.path() + ".strace";
+  const pid_t strace = testing::spawnProcess(
+      "/usr/bin/strace", {"-f", "-y", "-qq", "-o", trace, "-e", "trace=fsync,rename,mkdir,sendmsg",
+                          "-p", std::to_string(daemon.pid())});
+  ASSERT_GT(strace, 0);
+  ASSERT_TRUE(testing::waitUntilTraced(daemon.pid()));
+  auto made = ctl("app-client", {"create", "--class", "2", "--user", "501"});
+  ASSERT_EQ(made.exitStatus, 0) << made.output;
+  testing::stopProcess(strace, SIGINT);
+  const std::string path = fact(made.output, "path");
+  const std::string uuid = fs::path(path).filename();
+  const std::string classDirectory = fs::path(path).parent_path();
+
+  std::vector<std::string> calls;  // "fsync <path>", "rename <to>", "reply"
+  std::ifstream in(trace);
+  for (std::string line; std::getline(in, line);) {
+    if (const auto at = line.find("fsync("); at != std::string::npos) {
+      const auto open = line.find('<', at), close = line.find(">)", at);
+      if (open != std::string::npos && close != std::string::npos)
+        calls.push_back("fsync " + line.substr(open + 1, close - open - 1));
+    } else if (line.find("rename(") != std::string::npos &&
+               line.find("\", \"" + path + "\")") != std::string::npos) {
+      calls.push_back("rename " + path);
+    } else if (line.find("sendmsg(") != std::string::npos &&
+               line.find("ReplyError") != std::string::npos) {
+      calls.push_back("reply");
+    }
+  }
+  const auto position = [&](const std::string& call) {
+    return std::find(calls.begin(), calls.end(), call) - calls.begin();
+  };
+  const auto renamed = position("rename " + path);
+  ASSERT_LT(renamed, static_cast<long>(calls.size())) << trace;
+  const std::string staged =
+      scratch.resolve("/private/var/root/Library/Caches/com.zorvane.kestreld/Staging/") + uuid;
+  for (const char* directory :
+       {"/Documents", "/Library/Caches", "/Library/Preferences", "/Library", "/tmp", ""}) {
+    EXPECT_LT(position("fsync " + staged + directory), renamed) << directory;
+  }
+  const auto classSynced = position("fsync " + classDirectory);
+  EXPECT_GT(classSynced, renamed);
+  EXPECT_LT(classSynced, static_cast<long>(calls.size()));
+  EXPECT_GT(std::find(calls.begin() + classSynced, calls.end(), "reply") - calls.begin(),
+            classSynced);
+  EXPECT_NE(std::find(calls.begin() + classSynced, calls.end(), "reply"), calls.end());
+  fs::remove(trace);
   EXPECT_EQ(daemon.stop(), 0);
 }
 

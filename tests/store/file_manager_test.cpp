@@ -179,8 +179,8 @@ TEST_F(FileManagerTest, MoveAcrossFileSystemsSucceedsWholeOrLeavesNothingThere) 
   EXPECT_FALSE(manager.moveItemAtURL(url("held", true), url("other/held", true), &error));
   EXPECT_TRUE(isPOSIXError(error, EBUSY));
   EXPECT_FALSE(fakes.scratch.exists("/other/held"));
-  EXPECT_TRUE(fakes.logging->contains("_moveItemAtURL", "Failed to remove source " + path("held") +
-                                                           " : Device or resource busy"));
+  EXPECT_TRUE(fakes.logging->contains(
+      "_moveItemAtURL", "Failed to remove source " + path("held") + " : Device or resource busy"));
   // An item in the way is not taken for a partial copy.
   makeFile("other/taken/mine", "mine");
   makeFile("taken/theirs");

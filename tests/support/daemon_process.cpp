@@ -8,6 +8,8 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <filesystem>
+#include <fstream>
 #include <thread>
 
 extern char** environ;
@@ -100,6 +102,43 @@ ProcessResult runProcess(const std::string& program, const std::vector<std::stri
   }
   ::close(fds[0]);
   return result;
+}
+
+pid_t spawnProcess(const std::string& program, const std::vector<std::string>& arguments) {
+  std::vector<std::string> args{program};
+  args.insert(args.end(), arguments.begin(), arguments.end());
+  auto argv = pointers(args);
+  pid_t pid = -1;
+  if (posix_spawn(&pid, program.c_str(), nullptr, nullptr, argv.data(), environ) != 0) return -1;
+  return pid;
+}
+
+int stopProcess(pid_t pid, int signal) {
+  ::kill(pid, signal);
+  int status = 0;
+  ::waitpid(pid, &status, 0);
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
+bool waitUntilTraced(pid_t pid) {
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(20);
+  const std::string tasks = "/proc/" + std::to_string(pid) + "/task";
+  while (std::chrono::steady_clock::now() < deadline) {
+    bool all = true;
+    std::error_code ec;
+    for (const auto& task : std::filesystem::directory_iterator(tasks, ec)) {
+      std::ifstream status(task.path() / "status");
+      std::string line;
+      bool traced = false;
+      while (std::getline(status, line)) {
+        if (line.starts_with("TracerPid:")) traced = std::stol(line.substr(10)) != 0;
+      }
+      all = all && traced;
+    }
+    if (!ec && all) return true;
+    std::this_thread::sleep_for(std::chrono::milliseconds(10));
+  }
+  return false;
 }
 
 }  // namespace kestrel::testing

@@ -37,4 +37,11 @@ struct ProcessResult {
 ProcessResult runProcess(const std::string& program, const std::vector<std::string>& arguments,
                          const std::vector<std::string>& extraEnvironment = {});
 
+// Starts the program with the arguments and does not wait for it; -1 on failure.
+pid_t spawnProcess(const std::string& program, const std::vector<std::string>& arguments);
+// Sends the signal and waits for the process; its exit status, or -1.
+int stopProcess(pid_t pid, int signal);
+// Waits until every thread of the process has a tracer (strace -p attached).
+bool waitUntilTraced(pid_t pid);
+
 }  // namespace kestrel::testing
