@@ -61,7 +61,7 @@ KSTErrorRef KSTCodeSigningMappingState::_writeCodeSigningMappingToDisk() const {
   }
   KSTErrorRef writeError;
   if (KST_writeToURL(serialized, url_, kKSTDaemonFileWritingOptions, &writeError)) return nullptr;
-  return KST_ERROR(kKSTErrorMappingWriteFailed, writeError, false,
+  return KST_ERROR(kKSTErrorMappingWriteFailed, writeError, true,
                    "Failed to write entitlement mapping file at %@ : %@", url_,
                    PlistValue(serialized));
 }
@@ -70,7 +70,7 @@ KSTErrorRef KSTCodeSigningMappingState::_setCodeSigningDictionaryValues(
     const std::vector<KSTCodeSigningEntry>& values,
     const std::vector<std::string>& forIdentifiers) {
   if (values.size() != forIdentifiers.size()) {
-    return KST_ERROR(kKSTErrorMappingInvalidInput, nullptr, false,
+    return KST_ERROR(kKSTErrorMappingInvalidInput, nullptr, true,
                      "Can't act on an invalid input: values count: %ld, IDs count: %ld",
                      static_cast<long>(values.size()), static_cast<long>(forIdentifiers.size()));
   }
@@ -235,9 +235,11 @@ KSTGroupIdentifiers KSTCodeSigningMappingState::_onQueue_systemGroupIdentifiersF
                                                            kKSTSystemGroupContainersEntitlement);
   }
   if (!groups) return std::nullopt;
-  std::erase_if(*groups, [](const std::string& group) {
+  const char* const operation = __func__;
+  std::erase_if(*groups, [operation](const std::string& group) {
     if (group.starts_with(kKSTSystemGroupPrefix)) return false;
-    KSTLog(kLogError, "System group ID %@ does not have proper prefix, ignoring.", group);
+    KSTLogTag(kLogError, operation, "System group ID %@ does not have proper prefix, ignoring.",
+              group);
     return true;
   });
   return groups;

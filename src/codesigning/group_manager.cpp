@@ -50,9 +50,11 @@ std::uint64_t stageForDeletion(std::uint32_t userId, const KSTMetadata& containe
   return code;
 }
 
-KSTErrorRef invalidObjectError(std::uint32_t userId, const std::optional<std::string>& identifier) {
-  return KST_ERROR(kKSTErrorInvalidObject, nullptr, true,
-                   "Can't act on an invalid object: userId: %u, ID: %@", userId, identifier);
+// Built on behalf of the operation named.
+KSTErrorRef invalidObjectError(const char* operation, std::uint32_t userId,
+                               const std::optional<std::string>& identifier) {
+  return KST_ERROR_IN(operation, kKSTErrorInvalidObject, nullptr, true,
+                      "Can't act on an invalid object: userId: %u, ID: %@", userId, identifier);
 }
 
 }  // namespace
@@ -68,9 +70,10 @@ std::optional<PlistDictionary> KSTGroupManager::groupContainerPathsForUser(
     std::uint32_t userId, KSTClientConnection& clientConnection,
     const std::optional<std::string>& identifier, std::uint64_t* withError) {
   if (!identifier) {
-    KSTHandOverCode(invalidObjectError(userId, identifier), withError);
+    KSTHandOverCode(invalidObjectError(__func__, userId, identifier), withError);
     return std::nullopt;
   }
+  const char* const operation = __func__;
   return KST_CATCH_EXCEPTIONS(withError, std::nullopt, [&]() -> std::optional<PlistDictionary> {
     KSTAllIdentifiersLockGuard all(kKSTLockForWriting);
     KSTCodeSigningMapping& mapping = KSTCodeSigningMapping::sharedInstance();
@@ -88,8 +91,9 @@ std::optional<PlistDictionary> KSTGroupManager::groupContainerPathsForUser(
       const KSTMetadataRef container = clientConnection.createOrLookupContainerForUser(
           userId, group, true, groupClass, false, false, &code);
       if (!container) {
-        KSTLog(kLogError, "Failed to create or lookup group container-userId: %u, ID: %@ : %llu",
-               userId, *identifier, static_cast<unsigned long long>(code));
+        KSTLogTag(kLogError, operation,
+                  "Failed to create or lookup group container-userId: %u, ID: %@ : %llu", userId,
+                  *identifier, static_cast<unsigned long long>(code));
         continue;
       }
       paths.insert_or_assign(group, container->url().path());
@@ -101,7 +105,7 @@ std::optional<PlistDictionary> KSTGroupManager::groupContainerPathsForUser(
 std::optional<PlistArray> KSTGroupManager::groupContainerIdentifiersForUser(
     std::uint32_t userId, const std::optional<std::string>& identifier, std::uint64_t* withError) {
   if (!identifier) {
-    KSTHandOverCode(invalidObjectError(userId, identifier), withError);
+    KSTHandOverCode(invalidObjectError(__func__, userId, identifier), withError);
     return std::nullopt;
   }
   return KST_CATCH_EXCEPTIONS(withError, std::nullopt, [&]() -> std::optional<PlistArray> {
@@ -136,12 +140,14 @@ KSTGroupReferenceCounts KSTGroupManager::_copyReferenceCountSetOfType(
     KSTGroupType type, KSTCodeSigningMappingState& inMapping) {
   const GroupTypeTraits traits = traitsOf(type);
   KSTGroupReferenceCounts counts;
+  const char* const operation = __func__;
   inMapping.iterateGroupIdsWithKey(
       traits.key, traits.fallBackKey,
       [&](const std::string& identifier, const KSTGroupIdentifiers& groupIds) {
         if (!groupIds) return;
-        KSTLog(kLogDebug, "Entitlements for identifier %@ references container IDs: %@", identifier,
-               describedList(*groupIds));
+        KSTLogTag(kLogDebug, operation,
+                  "Entitlements for identifier %@ references container IDs: %@", identifier,
+                  describedList(*groupIds));
         for (const std::string& group : *groupIds) ++counts[group];
       });
   return counts;

@@ -113,5 +113,8 @@ inline void KSTSetError(KSTErrorRef* out, KSTErrorRef error) {
 #define KST_ERROR_IN(function, code, underlying, log, format, ...)                    \
   ::kestrel::KSTCreateError((function), __LINE__, ::kestrel::kKSTErrorDomain, (code), \
                             (underlying), nullptr, (log), (format)__VA_OPT__(, ) __VA_ARGS__)
+// KST_POSIX_ERROR_IN(function, errnum, format, args...): likewise for the POSIX domain.
+#define KST_POSIX_ERROR_IN(function, errnum, format, ...) \
+  ::kestrel::KSTCreatePOSIXError((function), __LINE__, (errnum), (format)__VA_OPT__(, ) __VA_ARGS__)
 #define KST_POSIX_ERROR(errnum, format, ...) \
   ::kestrel::KSTCreatePOSIXError(__func__, __LINE__, (errnum), (format)__VA_OPT__(, ) __VA_ARGS__)

@@ -61,6 +61,14 @@ bool Log::isEnabled(int level) {
 
 void Log::write(int level, std::string_view tag, std::string_view message) {
   if (!isEnabled(level)) return;
+  // One line never pushes the rest of a rotating log out (a message may
+  // describe a whole mapping or dictionary).
+  std::string shortened;
+  if (message.size() > Log::kMaxLogMessageBytes) {
+    shortened.assign(message.substr(0, Log::kMaxLogMessageBytes));
+    shortened += " ... (" + std::to_string(message.size() - Log::kMaxLogMessageBytes) + " bytes more)";
+    message = shortened;
+  }
   if (auto handle = currentHandle()) {
     handle->write(level, tag, message);
     return;

@@ -23,6 +23,8 @@ using platform::kLogNotice;
 class Log {
  public:
   static constexpr int kDefaultLevel = kLogNotice;
+  // Longer messages are cut there, and say how much was left out.
+  static constexpr std::size_t kMaxLogMessageBytes = 16 * 1024;
 
   // Opens the log facility for the subsystem at path, with the level. False
   // (and no handle) when it cannot be opened; lines then go to the platform's

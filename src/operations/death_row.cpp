@@ -50,6 +50,9 @@ bool removeItemOrMoveToTemp(const KSTFileURL& url, KSTErrorRef* error) {
   return false;
 }
 
+// The sweep of deleteContainersOnDeathRowWithCompletion, run on the death-row queue.
+constexpr const char* kSweepTag = "deleteContainersOnDeathRowWithCompletion";
+
 std::uint64_t sweepDeathRow() {
   const KSTFileManager& fileManager = KSTFileManager::defaultManager();
   const KSTFileURL deathRow = KSTGlobalConfiguration::sharedInstance().deathrowDirectory();
@@ -61,8 +64,8 @@ std::uint64_t sweepDeathRow() {
   if (!items) {
     if (listError && listError->isPOSIXError(ENOENT)) return kKSTSuccess;
     KSTErrorRef failure =
-        KST_ERROR(kKSTErrorDeleteFailed, listError, true,
-                  "Failed to get items for deletion: %@ : %@", deathRow, listError);
+        KST_ERROR_IN(kSweepTag, kKSTErrorDeleteFailed, listError, true,
+                     "Failed to get items for deletion: %@ : %@", deathRow, listError);
     KSTHandOverCode(failure, &code);
     return code;
   }
@@ -70,8 +73,8 @@ std::uint64_t sweepDeathRow() {
   for (const KSTFileURL& item : *items) {
     KSTErrorRef itemError;
     if (removeItemOrMoveToTemp(item, &itemError)) continue;
-    KSTErrorRef failure =
-        KST_ERROR(kKSTErrorDestroyFailed, itemError, true, "Failed to destroy item at: %@", item);
+    KSTErrorRef failure = KST_ERROR_IN(kSweepTag, kKSTErrorDestroyFailed, itemError, true,
+                                       "Failed to destroy item at: %@", item);
     KSTHandOverCode(failure, &code);
   }
   return code;

@@ -27,6 +27,8 @@ namespace kestrel {
 namespace {
 
 constexpr mode_t kContainerDirectoryMode = 0755;
+// The operation whose errors the builder's steps and the body's lambda build.
+constexpr const char* kCreateOrLookup = "createOrLookupContainerForUser";
 // The sub-directories of system containers belong to nobody (-2, as user and
 // group) and are closed by their mode; their ACL opens them to the system user.
 constexpr uid_t kSystemItemOwner = 4294967294u;
@@ -132,9 +134,9 @@ class ContainerBuilder {
     if (added && !durable) {
       // Left in place and known to the cache, like any container: asking
       // again finds it.
-      *error = KST_ERROR_IN("createOrLookupContainerForUser", kKSTErrorMoveStagingFailed, syncError,
-                            true, "Failed to move staging dir: %@ to live dir: %@", **staging,
-                            *destination);
+      *error =
+          KST_ERROR_IN(kCreateOrLookup, kKSTErrorMoveStagingFailed, syncError, true,
+                       "Failed to move staging dir: %@ to live dir: %@", **staging, *destination);
       return nullptr;
     }
     return added;
@@ -146,16 +148,16 @@ class ContainerBuilder {
                                    KSTErrorRef stepError) {
     KSTErrorRef moveError;
     if (client._moveItemAtURLToDeathRow(staging, true, true, &moveError)) return stepError;
-    return KST_ERROR(kKSTErrorRemoveStagingFailed, moveError, true,
-                     "Failed to remove staging dir: %@", staging);
+    return KST_ERROR_IN(kCreateOrLookup, kKSTErrorRemoveStagingFailed, moveError, true,
+                        "Failed to remove staging dir: %@", staging);
   }
 
  private:
   KSTMetadataRef buildInStaging(const KSTFileURL& staging, KSTErrorRef* error) {
     KSTErrorRef stepError;
     if (!client_._createTopLevelContainerDirectory(staging, containerClass_, userId_, &stepError)) {
-      *error = KST_ERROR(kKSTErrorCreateStagingFailed, stepError, true,
-                         "Failed to create staging dir at %@ : %@", staging, stepError);
+      *error = KST_ERROR_IN(kCreateOrLookup, kKSTErrorCreateStagingFailed, stepError, true,
+                            "Failed to create staging dir at %@ : %@", staging, stepError);
       return nullptr;
     }
     KSTMetadataRef record = KSTMetadata::initWithUserId(
@@ -181,8 +183,8 @@ class ContainerBuilder {
   static bool synchronizeStaging(const KSTFileURL& staging, KSTErrorRef* error) {
     KSTErrorRef syncError;
     if (KSTFileManager::defaultManager().synchronizeTreeAtURL(staging, &syncError)) return true;
-    *error = KST_ERROR_IN("createOrLookupContainerForUser", kKSTErrorCreateStagingFailed, syncError,
-                          true, "Failed to create staging dir at %@ : %@", staging, syncError);
+    *error = KST_ERROR_IN(kCreateOrLookup, kKSTErrorCreateStagingFailed, syncError, true,
+                          "Failed to create staging dir at %@ : %@", staging, syncError);
     return false;
   }
 
@@ -206,12 +208,12 @@ class ContainerBuilder {
       if (KSTFileManager::defaultManager().moveItemAtURL(staging, destination, &moveError)) {
         return destination;
       }
-      *error = KST_ERROR(kKSTErrorMoveStagingFailed, moveError, true,
-                         "Failed to move staging dir: %@ to live dir: %@", staging, destination);
+      *error = KST_ERROR_IN(kCreateOrLookup, kKSTErrorMoveStagingFailed, moveError, true,
+                            "Failed to move staging dir: %@ to live dir: %@", staging, destination);
       return std::nullopt;
     }
-    *error = KST_ERROR(kKSTErrorMoveStagingFailed, moveError, true,
-                       "Failed to move staging dir: %@ to live dir: %@", staging, nullptr);
+    *error = KST_ERROR_IN(kCreateOrLookup, kKSTErrorMoveStagingFailed, moveError, true,
+                          "Failed to move staging dir: %@ to live dir: %@", staging, nullptr);
     return std::nullopt;
   }
 
@@ -226,9 +228,9 @@ class ContainerBuilder {
       return record;
     }
     // The container is complete and stays; the next rebuild of the class map finds it.
-    *error = KST_ERROR(kKSTErrorCacheAddFailed, cacheError, true,
-                       "Failed to add to cache for %u : %@, url: %@, transient: %d", userId_,
-                       record, destination, transient_ ? 1 : 0);
+    *error = KST_ERROR_IN(kCreateOrLookup, kKSTErrorCacheAddFailed, cacheError, true,
+                          "Failed to add to cache for %u : %@, url: %@, transient: %d", userId_,
+                          record, destination, transient_ ? 1 : 0);
     return nullptr;
   }
 
@@ -287,8 +289,8 @@ KSTMetadataRef KSTClientConnection::createOrLookupContainerForUser(
       // A transient container is handed out fresh every time: the old one goes.
       KSTErrorRef moveError;
       if (!_moveItemAtURLToDeathRow(found->url(), true, true, &moveError)) {
-        failure = KST_ERROR(kKSTErrorRemoveTransientFailed, moveError, true,
-                            "Failed to remove transient container at %@", found->url());
+        failure = KST_ERROR_IN(kCreateOrLookup, kKSTErrorRemoveTransientFailed, moveError, true,
+                               "Failed to remove transient container at %@", found->url());
         return nullptr;
       }
       // Without this the entry would outlive its directory, and every later
@@ -301,8 +303,8 @@ KSTMetadataRef KSTClientConnection::createOrLookupContainerForUser(
     }
 
     if (!createIfNecessary) {
-      failure = KST_ERROR(kKSTErrorNotFound, nullptr, false,
-                          "Container with identifier: \"%@\" Not Found", *identifier);
+      failure = KST_ERROR_IN(kCreateOrLookup, kKSTErrorNotFound, nullptr, false,
+                             "Container with identifier: \"%@\" Not Found", *identifier);
       return nullptr;
     }
     ContainerBuilder builder(*this, userId, *identifier, containerClass, transient);

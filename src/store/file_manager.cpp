@@ -449,8 +449,9 @@ bool KSTFileManager::synchronizeTreeAtURL(const KSTFileURL& url, KSTErrorRef* er
     // A directory's second visit comes after everything beneath it.
     if (entry->fts_info != FTS_DP) return true;
     if (const int synced = synchronizeDirectory(entry->fts_accpath); synced != 0) {
-      KSTSetError(visitorError, KST_POSIX_ERROR(synced, "fsync of %s failed: %s", entry->fts_path,
-                                                errnoText(synced)));
+      KSTSetError(visitorError,
+                  KST_POSIX_ERROR_IN("synchronizeTreeAtURL", synced, "fsync of %s failed: %s",
+                                     entry->fts_path, errnoText(synced)));
       return false;
     }
     return true;

@@ -71,6 +71,8 @@ TEST_F(CodeSigningMappingTest, StoreStartsEmptyWritesOnlyChangesAndPersistsAcros
   EXPECT_TRUE(testing::isError(testing::storeEntries(second, {app}, {"a", "b"}),
                                kKSTErrorMappingInvalidInput,
                                "Can't act on an invalid input: values count: 1, IDs count: 2"));
+  EXPECT_TRUE(fakes.logged("Can't act on an invalid input: values count: 1, IDs count: 2",
+                           testing::Match::Contains, "_setCodeSigningDictionaryValues"));
 }
 
 TEST_F(CodeSigningMappingTest, AFailedSaveKeepsTheChangeAndAnUnreadableFileTheStore) {
@@ -78,6 +80,8 @@ TEST_F(CodeSigningMappingTest, AFailedSaveKeepsTheChangeAndAnUnreadableFileTheSt
   fs::create_directories(mappingPath());  // a directory in the file's place
   KSTErrorRef error = store(mapping, "com.example.app", Entry(infoWithEntitlements({}), 2));
   ASSERT_TRUE(testing::isError(error, kKSTErrorMappingWriteFailed));
+  EXPECT_TRUE(fakes.logged("Failed to write entitlement mapping file at " + mappingPath(),
+                           testing::Match::Contains, "_writeCodeSigningMappingToDisk"));
   EXPECT_TRUE(fakes.logging->containsMessage(
       "Error writing code signing mappings to disk after set : " + error->description()));
   EXPECT_TRUE(mapping.codeSigningInfoExistForIdentifier("com.example.app"));

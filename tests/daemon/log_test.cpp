@@ -41,6 +41,13 @@ TEST_F(LogTest, LevelsFilterOnlyWhileThereIsAHandle) {
   Log::setCurrentLevel(kLogError);
   writeOneOfEach();
   EXPECT_EQ(fakes.logging->lines().size(), 1u);
+
+  // A very long message is cut, and says so.
+  fakes.logging->clear();
+  KSTLog(kLogError, "%@", std::string(Log::kMaxLogMessageBytes + 10, 'x'));
+  ASSERT_EQ(fakes.logging->lines().size(), 1u);
+  EXPECT_EQ(fakes.logging->lines()[0].message,
+            std::string(Log::kMaxLogMessageBytes, 'x') + " ... (10 bytes more)");
 }
 
 // The real disk log: one file of 102400 bytes on a customer build, four of

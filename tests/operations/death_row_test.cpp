@@ -171,7 +171,8 @@ TEST_F(DeathRowTest, EntryThatCannotBeRemovedNorMovedFailsEverySweepAlikeUntilIt
     EXPECT_EQ(namesIn(deathRow()), Strings{"stuck"});
     EXPECT_TRUE(namesIn(tmp()).empty());
   }
-  EXPECT_TRUE(fakes.logged("Failed to destroy item at: " + deathRow() + "/stuck"));
+  EXPECT_TRUE(fakes.logged("Failed to destroy item at: " + deathRow() + "/stuck",
+                           testing::Match::Contains, "deleteContainersOnDeathRowWithCompletion"));
 
   // Alone, it fails with the move's error, which is the failed removal of its source.
   KSTErrorRef error;
@@ -280,7 +281,8 @@ TEST_F(DeathRowTest, CommandRepliesWithTheSweepsCodeOnceItEnded) {
   ASSERT_TRUE(connection->deliver(request));
   ASSERT_TRUE(connection->waitForReplies(2, 20s));
   EXPECT_EQ(connection->lastReply()->uint64(kKSTReplyErrorKey), kKSTErrorDeleteFailed);
-  EXPECT_TRUE(fakes.logged("Failed to get items for deletion: " + path + " : "));
+  EXPECT_TRUE(fakes.logged("Failed to get items for deletion: " + path + " : ",
+                           testing::Match::Contains, "deleteContainersOnDeathRowWithCompletion"));
 }
 
 }  // namespace

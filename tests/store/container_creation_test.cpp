@@ -208,6 +208,9 @@ TEST_F(ContainerCreationTest, WellKnownSystemContainerTakesItsNameAndAFailedMove
   fs::create_directories(system / "com.zorvane.ternd/left-over");
   EXPECT_FALSE(create(499, 12, "com.zorvane.ternd", &code));
   EXPECT_EQ(code, kKSTErrorMoveStagingFailed);
+  // Logged under the operation's name, not its helper's.
+  EXPECT_TRUE(fakes.logged("Failed to move staging dir: ", testing::Match::Contains,
+                           "createOrLookupContainerForUser"));
   EXPECT_EQ(treeOf(system / "com.zorvane.ternd"), Names{"left-over"});
   EXPECT_TRUE(fs::is_empty(staging()));
 }
