@@ -13,6 +13,7 @@
 #include <sys/types.h>
 
 #include "daemon/errors.h"
+#include "operations/replace_journal.h"
 #include "platform/uuid.h"
 #include "store/container_class.h"
 #include "store/file_url.h"
@@ -85,11 +86,51 @@ class KSTClientConnection {
                               KSTContainerClass containerClass, bool transient,
                               std::uint64_t* withError);
 
+  // Replace (operations/replace.cpp): the container of UUID withContainer
+  // takes the place of the one of oldUUID (same class and user), journalled
+  // so that a crash half-way is undone at the next start. Without an old
+  // container the new one goes to its class directory under its directory
+  // name. preserveOldUUID: the new content takes the old path and UUID. The
+  // code is written only on failure: 10, 11, 14, 15, 21, 22, 23, 27, 33, 34,
+  // 36, 45, 46, 56 and those of the code-signing store.
+  void replaceContainer(const std::optional<platform::Uuid>& oldUUID,
+                        const std::optional<platform::Uuid>& withContainer, std::uint32_t userIdOld,
+                        std::uint32_t userIdNew, const std::optional<std::string>& identifierOld,
+                        const std::optional<std::string>& identifierNew,
+                        KSTContainerClass containerClassOld, KSTContainerClass containerClassNew,
+                        bool preserveOldUUID, bool startDeletionThread, std::uint64_t* withError);
+  // The journal: written atomically (binary, protection class none) with all
+  // four paths (33 without one, 34 when it cannot be written), and read back
+  // (35 when unreadable or not four absolute paths).
+  bool _writeToDiskReplaceAt(const std::optional<KSTFileURL>& url,
+                             const std::optional<KSTFileURL>& old,
+                             const std::optional<KSTFileURL>& withNew,
+                             const std::optional<KSTFileURL>& usingStaging,
+                             const std::optional<KSTFileURL>& toDestination, KSTErrorRef* error);
+  std::optional<KSTReplaceJournal> _readAndValidateReplaceFileAtUrl(const KSTFileURL& url,
+                                                                    KSTErrorRef* error);
+  // At start-up: every journal left behind is rolled back where the swap
+  // stopped half-way, and retired. False (35, 36) stops at that journal; it
+  // and the later ones stay for the next start.
+  bool _recoverFromReplaceOperationsWithError(KSTErrorRef* error);
+
+  // Wipe (operations/container_wipe.cpp): the data container of the
+  // identifier is replaced by a fresh empty one that keeps its path and UUID;
+  // its content goes to death row. Refusals log and answer 11, 18 or 55.
+  void deleteDataContainerContentForUser(std::uint32_t userId,
+                                         const std::optional<std::string>& identifier,
+                                         KSTContainerClass containerClass,
+                                         std::uint64_t* withError);
+
   // Start-up and boot housekeeping of the container store.
   void rebootContainerManagerSetup();
   void containerManagerSetup();
   void rebootContainerManagerCleanup();
   void containerManagerCleanup();
+  // Retires what does not belong in the class directory: entries named
+  // neither by a UUID nor by a well-known name, and containers without a
+  // metadata file.
+  void _cleanupOrphanedDataForUser(std::uint32_t userId, KSTContainerClass containerClass);
 
   bool _setSandboxContainerMappingForUser(std::uint32_t userId, const std::string& identifier,
                                           KSTContainerClass containerClass,

@@ -13,9 +13,16 @@ bool KSTCommandIsAvailable(const KSTCommandRow& row);
 void KSTHandleCreateOrLookupContainer(KSTCommandContext& context);
 void KSTHandleListContainers(KSTCommandContext& context);
 
+// 2: replaces a container by another.
+void KSTHandleReplaceContainer(KSTCommandContext& context);
+
 // 3: stages a batch of containers for deletion; 10: deletes one container.
 void KSTHandleStageForDelete(KSTCommandContext& context);
 void KSTHandleDeleteContainer(KSTCommandContext& context);
+// 11: wipes a plug-in data container named by the client's wipe entitlement;
+// 12: wipes a data container's content.
+void KSTHandleWipePluginContainer(KSTCommandContext& context);
+void KSTHandleWipeContainer(KSTCommandContext& context);
 
 // 4: the death-row sweep; replies from its completion.
 void KSTHandleDeleteDeathRow(KSTCommandContext& context);

@@ -10,7 +10,7 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {0, KSTHandleCreateOrLookupContainer, kKSTEntitlementNone,
        1},                                                        // create or look up a container
       {1, KSTHandleListContainers, kKSTEntitlementAllowed, 1},    // list the containers of a class
-      {2, nullptr, kKSTEntitlementAllowed, 1},                    // replace a container by another
+      {2, KSTHandleReplaceContainer, kKSTEntitlementAllowed, 1},  // replace a container by another
       {3, KSTHandleStageForDelete, kKSTEntitlementAllowed, 1},    // stage containers for deletion
       {4, KSTHandleDeleteDeathRow, kKSTEntitlementAllowed, 0},    // destroy what is on death row
       {5, nullptr, kKSTEntitlementAllowed, 1},                    // set an info value
@@ -19,8 +19,9 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {8, nullptr, kKSTEntitlementAllowed, 1},                    // recreate the default structure
       {9, nullptr, kKSTEntitlementAllowed, 1},                    // give a container a new UUID
       {10, KSTHandleDeleteContainer, kKSTEntitlementAllowed, 1},  // delete a container
-      {11, nullptr, kKSTEntitlementWipeContainer, 1},             // wipe a plug-in data container
-      {12, nullptr, kKSTEntitlementAllowed, 1},  // delete a data container's content
+      {11, KSTHandleWipePluginContainer, kKSTEntitlementWipeContainer,
+       1},                                              // wipe a plug-in data container
+      {12, KSTHandleWipeContainer, kKSTEntitlementAllowed, 1},  // delete a data container's content
       {13, KSTHandleAppGroupContainerPaths, kKSTEntitlementNone,
        1},  // the client's app-group paths
       {14, KSTHandleAppGroupIdentifiers, kKSTEntitlementAllowed,

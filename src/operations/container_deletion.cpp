@@ -16,6 +16,7 @@
 #include "daemon/exceptions.h"
 #include "daemon/locks.h"
 #include "daemon/log.h"
+#include "platform/crash_point.h"
 #include "store/container_cache.h"
 #include "store/container_identifier.h"
 #include "store/file_manager.h"
@@ -90,6 +91,7 @@ bool stageForDeleteContainersWithUsers(KSTClientConnection& client,
       }
     }
 
+    KST_CRASH_POINT("delete.moved");
     if (!client._setSandboxContainerMappingForUser(userId, *identifier, containerClass,
                                                    std::nullopt)) {
       KSTLog(kLogError, "Failed to remove container mapping in delete operation of %@, %llu",
@@ -105,6 +107,7 @@ bool stageForDeleteContainersWithUsers(KSTClientConnection& client,
                                    container->identifier(), containerClass, transient ? 1 : 0));
       return false;
     }
+    KST_CRASH_POINT("delete.uncached");
   }
   return true;
 }

@@ -11,6 +11,7 @@
 #include "daemon/errors.h"
 #include "daemon/exceptions.h"
 #include "daemon/log.h"
+#include "platform/crash_point.h"
 #include "platform/services.h"
 #include "store/file_manager.h"
 #include "store/global_configuration.h"
@@ -106,9 +107,11 @@ bool KSTClientConnection::_moveItemAtURLToDeathRow(const KSTFileURL& url, bool i
       return false;
     }
 
+    KST_CRASH_POINT("death-row.holder-made");
     const KSTFileURL destination = holder->appending(url.lastPathComponent(), isDir);
     KSTErrorRef moveError;
     if (fileManager.moveItemAtURL(url, destination, &moveError)) {
+      KST_CRASH_POINT("death-row.moved");
       if (startDeletionThread) deleteContainersOnDeathRowWithCompletion(nullptr);
       return true;
     }

@@ -16,6 +16,7 @@
 #include "daemon/errors.h"
 #include "daemon/exceptions.h"
 #include "daemon/locks.h"
+#include "platform/crash_point.h"
 #include "platform/uuid.h"
 #include "store/container_cache.h"
 #include "store/container_identifier.h"
@@ -163,6 +164,7 @@ class ContainerBuilder {
     KSTMetadataRef record = KSTMetadata::initWithUserId(
         userId_, platform::Uuid::random(), containerClass_, identifier_, std::nullopt, staging);
     if (!record->writeMetadataToDiskWithError(error)) return nullptr;
+    KST_CRASH_POINT("create.metadata-written");
 
     const KSTFileManager& fileManager = KSTFileManager::defaultManager();
     const bool isSystem = KSTIsSystemClass(containerClass_);
@@ -206,6 +208,7 @@ class ContainerBuilder {
       KSTFileURL destination =
           classDirectory->appending(wellknownName.value_or(directoryName), true);
       if (KSTFileManager::defaultManager().moveItemAtURL(staging, destination, &moveError)) {
+        KST_CRASH_POINT("create.in-place");
         return destination;
       }
       *error = KST_ERROR_IN(kCreateOrLookup, kKSTErrorMoveStagingFailed, moveError, true,
@@ -225,6 +228,7 @@ class ContainerBuilder {
     KSTErrorRef cacheError;
     if (KSTContainerCache::sharedInstance().addContainerMetadata(record, userId_, destination,
                                                                  transient_, &cacheError)) {
+      KST_CRASH_POINT("create.cached");
       return record;
     }
     // The container is complete and stays; the next rebuild of the class map finds it.
@@ -293,6 +297,7 @@ KSTMetadataRef KSTClientConnection::createOrLookupContainerForUser(
                                "Failed to remove transient container at %@", found->url());
         return nullptr;
       }
+      KST_CRASH_POINT("create.transient-retired");
       // Without this the entry would outlive its directory, and every later
       // lookup of the identifier would fail as inconsistent.
       cache.removeContainerForUser(userId, containerClass, *identifier, transient, nullptr);
