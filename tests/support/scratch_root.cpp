@@ -53,14 +53,19 @@ ScratchRoot::ScratchRoot() {
   fs::create_directories(resolve("/etc"));
   fs::copy_file(seed / "passwd", resolve("/etc/passwd"));
   fs::copy_file(seed / "group", resolve("/etc/group"));
-  fs::create_directories(resolve("/private/var/mobile"));
-  // Where death row puts what it cannot remove.
-  fs::create_directories(resolve("/tmp"));
-  fs::permissions(resolve("/tmp"), fs::perms(01777));
-  fs::create_directories(resolve("/private/var/mobile2"));
-  if (::chown(resolve("/private/var/mobile").c_str(), 501, 501) != 0 ||
-      ::chown(resolve("/private/var/mobile2").c_str(), 502, 502) != 0) {
-    throw std::runtime_error("chown of the mobile homes failed (tests run as root)");
+  // The directories the demo's roots have too.
+  std::ifstream directories(fs::path(KESTREL_SOURCE_DIR) / "tools/scratch-root/directories");
+  for (std::string line; std::getline(directories, line);) {
+    if (line.empty() || line.front() == '#') continue;
+    std::istringstream fields(line);
+    std::string path, mode;
+    unsigned owner = 0;
+    fields >> path >> mode >> owner;
+    fs::create_directories(resolve(path));
+    fs::permissions(resolve(path), fs::perms(std::stoul(mode, nullptr, 8)));
+    if (::chown(resolve(path).c_str(), owner, owner) != 0) {
+      throw std::runtime_error("chown of " + path + " failed (tests run as root)");
+    }
   }
 }
 
