@@ -63,11 +63,36 @@ TEST(KestrelctlFsckTest, CleanStoreThenEachKindOfDamage) {
   fs::copy(app->url().path(), copy, fs::copy_options::recursive);
   fs::create_directories(
       fs::path(KSTGlobalConfiguration::sharedInstance().stagingDirectory().path()) / "HALF");
-  report = kestrelctl::checkContainerStore(nullptr);
+  report = kestrelctl::checkContainerStore(list);
   EXPECT_TRUE(mentions(report, "STRAY: not a valid container"));
   EXPECT_TRUE(mentions(report, "com.example.app has 2 containers"));
   EXPECT_TRUE(mentions(report, "HALF: left in staging"));
-  EXPECT_EQ(report.problems.size(), 3u);
+
+  // Offline, staging and journals are what the next start finishes; only a
+  // journal it could not recover from is a problem.
+  fs::remove_all(classDirectory / "STRAY");
+  fs::remove_all(copy);
+  const std::string staging = KSTGlobalConfiguration::sharedInstance().stagingDirectory().path();
+  const auto journal = [&](const std::string& name, const std::string& old) {
+    const std::string path =
+        KSTGlobalConfiguration::sharedInstance().replaceDirectory().path() + "/" + name;
+    ASSERT_TRUE(client._writeToDiskReplaceAt(
+        KSTFileURL(path), KSTFileURL(old, true), KSTFileURL(staging + "/new", true),
+        KSTFileURL(staging + "/HALF", true), KSTFileURL(staging + "/dest", true), nullptr));
+  };
+  journal("parked.plist", staging + "/old");
+  journal("another.plist", staging + "/gone");
+  fs::remove_all(staging + "/HALF");
+  report = kestrelctl::checkContainerStore(nullptr);
+  EXPECT_EQ(report.problems.size(), 2u);
+  EXPECT_TRUE(mentions(report, "parked.plist: replace journal, cannot be recovered"));
+  fs::create_directories(staging + "/HALF");
+  report = kestrelctl::checkContainerStore(nullptr);
+  ASSERT_EQ(report.pending.size(), 3u);
+  EXPECT_NE(report.pending[0].find("replace journal, old container parked: the next start moves"),
+            std::string::npos);
+  EXPECT_NE(report.pending[2].find("HALF: left in staging: the next start retires it"),
+            std::string::npos);
 }
 
 }  // namespace

@@ -2,6 +2,7 @@
 
 #include <map>
 
+#include "daemon/client_connection.h"
 #include "daemon/daemon_state.h"
 #include "store/file_manager.h"
 #include "store/global_configuration.h"
@@ -66,6 +67,59 @@ Pairs checkClassDirectory(const KSTFileURL& directory, std::uint32_t user, FsckR
   return found;
 }
 
+// What the next start does with one replace journal, by what exists now.
+void checkJournal(const KSTFileURL& url, bool daemonRunning, FsckReport* report) {
+  const KSTFileManager& files = KSTFileManager::defaultManager();
+  KSTErrorRef error;
+  const std::optional<KSTReplaceJournal> journal =
+      KSTClientConnection::sharedClientConnection()._readAndValidateReplaceFileAtUrl(url, &error);
+  std::string outcome;
+  bool recoverable = true;
+  if (!journal) {
+    outcome = "invalid (" + (error ? error->description() : std::string("?")) +
+              "): the next start discards it";
+  } else if (files.itemExistsAtURL(journal->oldURL)) {
+    outcome = "swap not begun, or done in place: the next start discards it";
+  } else if (files.itemExistsAtURL(journal->destURL)) {
+    outcome = "swap done: the next start discards it; the old container waits in staging";
+  } else if (files.itemExistsAtURL(journal->stagingURL)) {
+    outcome = "old container parked: the next start moves " + journal->stagingURL.path() +
+              " back to " + journal->oldURL.path();
+  } else {
+    outcome =
+        "cannot be recovered: neither the old container, the new one nor the parked one "
+        "is there";
+    recoverable = false;
+  }
+  const std::string line = url.path() + ": replace journal, " + outcome;
+  if (daemonRunning || !recoverable) {
+    report->problems.push_back(line);
+  } else {
+    report->pending.push_back(line);
+  }
+}
+
+// Replace journals and staging leftovers: interrupted work.
+void checkInterruptedWork(bool daemonRunning, FsckReport* report) {
+  KSTGlobalConfiguration& layout = KSTGlobalConfiguration::sharedInstance();
+  const KSTFileManager& files = KSTFileManager::defaultManager();
+  if (const auto journals =
+          files.urlsForItemsInDirectoryAtURL(layout.replaceDirectory(), nullptr)) {
+    for (const KSTFileURL& journal : *journals) checkJournal(journal, daemonRunning, report);
+  }
+  if (const auto leftovers =
+          files.urlsForItemsInDirectoryAtURL(layout.stagingDirectory(), nullptr)) {
+    for (const KSTFileURL& item : *leftovers) {
+      if (daemonRunning) {
+        report->problems.push_back(item.path() + ": left in staging");
+      } else {
+        report->pending.push_back(item.path() +
+                                  ": left in staging: the next start retires it to death row");
+      }
+    }
+  }
+}
+
 }  // namespace
 
 FsckReport checkContainerStore(const ListContainers& listContainers) {
@@ -107,15 +161,7 @@ FsckReport checkContainerStore(const ListContainers& listContainers) {
     }
   }
 
-  KSTErrorRef stagingError;
-  const KSTFileURL staging = layout.stagingDirectory();
-  const auto leftovers =
-      KSTFileManager::defaultManager().urlsForItemsInDirectoryAtURL(staging, &stagingError);
-  if (leftovers) {
-    for (const KSTFileURL& item : *leftovers) {
-      report.problems.push_back(item.path() + ": left in staging");
-    }
-  }
+  checkInterruptedWork(static_cast<bool>(listContainers), &report);
   return report;
 }
 

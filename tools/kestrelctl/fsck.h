@@ -1,12 +1,19 @@
-// A consistency check of the container store beneath a root, for operators
-// and for the load test: every entry of every class directory must be a
-// valid container, no identifier may have two live containers of one class,
-// nothing may be left in staging, and (when the daemon is asked too) its
-// cache must list exactly what is on disk.
+// A consistency check of the container store beneath a root, for operators,
+// the load test and the crash test: every entry of every class directory must
+// be a valid container, no identifier may have two live containers of one
+// class, and (when the daemon is asked too) its cache must list exactly what
+// is on disk.
 //
-// Uses the daemon's own layout and metadata reader, so the platform services
-// for the root must be installed first. Run it while the daemon is idle:
-// a creation in flight legitimately has a directory in staging.
+// Staging and replace journals: a running daemon leaves neither once it is
+// idle, so with the daemon each is a problem. Without it (offline, after a
+// crash) they are what the next start finishes: each is reported as pending,
+// with what the start will do; a journal that start could not recover from
+// is a problem either way.
+//
+// Uses the daemon's own layout and metadata and journal readers, so the
+// platform services for the root must be installed first. Run it while the
+// daemon is idle: a creation or replace in flight legitimately has a
+// directory in staging.
 #pragma once
 
 #include <cstddef>
@@ -30,6 +37,7 @@ struct FsckReport {
   std::size_t containers = 0;         // valid containers found on disk
   std::size_t classDirectories = 0;   // class directories looked at
   std::vector<std::string> problems;  // one line each; empty when all is well
+  std::vector<std::string> pending;   // offline: what the next start will finish
 };
 
 // Checks every class directory of the users the store knows: 33 for bundles,

@@ -271,6 +271,7 @@ int runFsck(const platform::FilesystemRoot& root, const std::string& address, bo
   }
   const kestrelctl::FsckReport report = kestrelctl::checkContainerStore(list);
   for (const std::string& problem : report.problems) std::cout << problem << "\n";
+  for (const std::string& pending : report.pending) std::cout << "pending: " << pending << "\n";
   std::cout << report.containers << " containers in " << report.classDirectories
             << " class directories" << (offline ? "" : ", compared with the daemon's cache") << ": "
             << (report.problems.empty() ? "clean"
