@@ -15,6 +15,7 @@
 #include <random>
 #include <set>
 #include <string>
+#include <string_view>
 #include <thread>
 #include <vector>
 
@@ -42,6 +43,13 @@ const std::vector<Operation>& operations() {
       {"system-container", 8, {1}},
       {"delete", 12, {1, 21}},
       {"sweep", 5, {1}},
+      // A transient container made and swapped in for the live one (or
+      // installed when there is none). Another client may swap first, retire
+      // the transient one or make the identifier live meanwhile.
+      {"replace", 8, {1, 21, 27}},
+      // Replaced by an empty container in place; a concurrent swap may take
+      // the container or its fresh transient one away first.
+      {"wipe", 6, {1, 21}},
   };
   return mix;
 }
@@ -70,10 +78,38 @@ MessageDictionary requestFor(const std::string& name, const std::string& identif
     request.setString("Identifier", "com.zorvane.egretd");
   } else if (name == "delete") {
     container(10, 2);
+  } else if (name == "wipe") {
+    container(12, 2);
   } else {
     request.setUint64("Command", 4);
   }
   return request;
+}
+
+// A replace: the live container (if any) looked up, a transient one made,
+// and the swap; the swap's code, or the first step's when it failed.
+std::uint64_t replace(DaemonConnection& connection, const std::string& identifier) {
+  MessageDictionary lookup = requestFor("lookup", identifier);
+  MessageDictionary old;
+  const std::uint64_t found = connection.request(lookup, &old);
+  if (found != 1 && found != 21) return found;
+  MessageDictionary make = requestFor("create", identifier);
+  make.setBoolean("Transient", true);
+  MessageDictionary fresh;
+  if (const std::uint64_t made = connection.request(make, &fresh); made != 1) return made;
+  MessageDictionary swap;
+  swap.setUint64("Command", 2);
+  if (found == 1 && old.uuid("ReplyUUID")) {
+    swap.setUuid("OldContainerUUID", *old.uuid("ReplyUUID"));
+    swap.setUint64("OldContainerClass", 2);
+    swap.setUint64("OldContainerUserID", 501);
+    swap.setString("OldIdentifier", identifier);
+  }
+  swap.setUint64("NewContainerClass", 2);
+  swap.setUint64("NewContainerUserID", 501);
+  if (const auto uuid = fresh.uuid("ReplyUUID")) swap.setUuid("NewContainerUUID", *uuid);
+  swap.setString("NewIdentifier", identifier);
+  return connection.request(swap);
 }
 
 struct Tally {
@@ -138,7 +174,9 @@ int run(int argc, char** argv) {
             pick -= candidate.weight;
           }
           const std::string& identifier = pool[random() % pool.size()];
-          const std::uint64_t code = connection.request(requestFor(op->name, identifier));
+          const std::uint64_t code = std::string_view(op->name) == "replace"
+                                         ? replace(connection, identifier)
+                                         : connection.request(requestFor(op->name, identifier));
           ++mine.done[op->name];
           if (!op->expected.count(code)) {
             ++mine.unexpected[std::string(op->name) + " " + std::to_string(code)];
