@@ -175,35 +175,17 @@ TEST_F(ReplaceTest, SwapThatStopsHalfWayIsRolledBack) {
       testing::Match::Contains));
 }
 
-TEST_F(ReplaceTest, RecoveryFinishesOrUndoesWhatEachJournalLeft) {
+// The states a journal can find are driven through the real daemon by the
+// crash test; here, the journals that recovery cannot act on.
+TEST_F(ReplaceTest, RecoveryDiscardsWhatItCannotReadAndKeepsWhatItCannotUndo) {
   const std::string classDirectory = testing::classDirectory(501, 2);
   const auto place = [&](const std::string& name) { return classDirectory + "/" + name; };
   const auto parked = [&](const std::string& name) { return staging() + "/" + name; };
-  const auto container = [](const std::string& path) {
-    fs::create_directories(path);
-    std::ofstream(path + "/.com.zorvane.kestrel.metadata.plist") << "m";
-  };
-  // Not started: the old one is where it was.
-  container(place("A"));
-  journal(place("A"), place("A2"), parked("a"), place("A2"));
-  // Old parked, new not arrived: the old one comes back.
-  container(parked("b"));
-  journal(place("B"), place("B2"), parked("b"), place("B2"));
-  // New in place: nothing to undo; the parked old one stays for Staging's clean-up.
-  container(parked("c"));
-  container(place("C2"));
-  journal(place("C"), place("C2"), parked("c"), place("C2"));
-  // A journal that holds no dictionary.
   std::ofstream(replaceDirectory() + "/bad.plist") << "not a property list";
-
   KSTErrorRef error;
   ASSERT_TRUE(installer._recoverFromReplaceOperationsWithError(&error))
       << testing::messageOf(error);
   EXPECT_TRUE(namesIn(replaceDirectory()).empty());
-  EXPECT_EQ(namesIn(classDirectory), (Strings{"A", "B", "C2"}));
-  EXPECT_EQ(namesIn(staging()), Strings{"c"});
-  EXPECT_TRUE(fakes.logged("Recovering from failed replace by moving: " + parked("b") + " to " +
-                           place("B")));
   EXPECT_TRUE(
       fakes.logged("Failed to read replace file at URL " + replaceDirectory() + "/bad.plist"));
 

@@ -85,45 +85,6 @@ TEST_F(ContainerEndToEndTest, AppGetsItsOwnContainersAndTheInstallerListsThem) {
   EXPECT_EQ(daemon.stop(), 0);
 }
 
-// Command 2 swaps a prepared transient container in; command 12 empties it in place.
-TEST_F(ContainerEndToEndTest, ReplaceSwapsInAPreparedContainerAndWipeEmptiesItInPlace) {
-  testing::DaemonProcess daemon(scratch.path());
-  ASSERT_TRUE(daemon.ready());
-  const std::vector<std::string> id = {"--class",         "2", "--user", "501", "--identifier",
-                                       "com.example.swap"};
-  const auto ctlWith = [&](std::vector<std::string> args, std::vector<std::string> more = {}) {
-    args.insert(args.end(), id.begin(), id.end());
-    args.insert(args.end(), more.begin(), more.end());
-    return ctl("allowed-client", args);
-  };
-  auto old = ctlWith({"create"});
-  auto fresh = ctlWith({"create"}, {"--transient"});
-  ASSERT_EQ(old.exitStatus + fresh.exitStatus, 0) << old.output << fresh.output;
-  std::ofstream(fact(fresh.output, "path") + "/Documents/prepared") << "x";
-  auto swapped =
-      call("allowed-client",
-           {"2", "OldContainerUUID=uuid:" + fact(old.output, "uuid"), "OldContainerClass=u64:2",
-            "OldContainerUserID=u64:501", "OldIdentifier=str:com.example.swap",
-            "NewContainerUUID=uuid:" + fact(fresh.output, "uuid"), "NewContainerClass=u64:2",
-            "NewContainerUserID=u64:501", "NewIdentifier=str:com.example.swap"});
-  ASSERT_EQ(swapped.exitStatus, 0) << swapped.output;
-  auto live = ctlWith({"lookup"});
-  EXPECT_EQ(fact(live.output, "uuid"), fact(fresh.output, "uuid"));
-  const std::string path = fact(live.output, "path");
-  EXPECT_TRUE(fs::exists(path + "/Documents/prepared"));
-  EXPECT_FALSE(fs::exists(fact(old.output, "path")));
-
-  auto wiped = call("allowed-client", {"12", "ContainerClass=u64:2", "UserID=u64:501",
-                                       "Identifier=str:com.example.swap"});
-  ASSERT_EQ(wiped.exitStatus, 0) << wiped.output;
-  live = ctlWith({"lookup"});
-  EXPECT_EQ(fact(live.output, "path"), path);
-  EXPECT_EQ(fact(live.output, "uuid"), fact(fresh.output, "uuid"));
-  EXPECT_FALSE(fs::exists(path + "/Documents/prepared"));
-  EXPECT_TRUE(fs::is_directory(path + "/Library/Preferences"));
-  EXPECT_EQ(daemon.stop(), 0);
-}
-
 // The system calls of one creation, watched from outside with strace: the
 // whole container reaches the disk before the rename that makes it live, and
 // the class directory after it, before the reply.
