@@ -5,6 +5,8 @@
 #
 #   scripts/load-test.sh [seconds] [clients]      # default 20 s, 4 clients
 #   KESTREL_PRESET=tsan scripts/load-test.sh 60   # the daemon under TSan (or asan)
+#   KESTREL_TEST_DAEMON_WRAPPER=tools/confined-daemon.sh scripts/load-test.sh
+#                                      # the daemon confined as its unit confines it
 set -euo pipefail
 cd "$(dirname "$0")/.."
 seconds="${1:-20}"
@@ -39,7 +41,7 @@ reports="$root.sanitizer"
 KESTREL_ROOT="$root" ASAN_OPTIONS="log_path=$reports" \
   UBSAN_OPTIONS="log_path=$reports:print_stacktrace=1" \
   TSAN_OPTIONS="log_path=$reports:second_deadlock_stack=1:suppressions=$PWD/tools/tsan.supp" \
-  "$build_dir/kestreld" 2>/dev/null &
+  ${KESTREL_TEST_DAEMON_WRAPPER:+"$KESTREL_TEST_DAEMON_WRAPPER"} "$build_dir/kestreld" 2>/dev/null &
 pid=$!
 status=0
 stop_daemon() {

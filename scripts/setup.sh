@@ -5,7 +5,7 @@ set -euo pipefail
 packages=(
   cmake ninja-build g++ pkg-config
   libsystemd-dev libplist-dev libspdlog-dev libfmt-dev libacl1-dev libattr1-dev uuid-dev
-  libcli11-dev nlohmann-json3-dev
+  libcli11-dev nlohmann-json3-dev scdoc
   googletest libgtest-dev libgmock-dev libbenchmark-dev
   acl systemd strace util-linux
 )

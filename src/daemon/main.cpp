@@ -7,6 +7,7 @@
 #include "daemon/request_dispatch.h"
 #include "daemon/startup.h"
 #include "platform/dispatch.h"
+#include "platform/heartbeat.h"
 #include "platform/process.h"
 #include "platform/services.h"
 
@@ -28,6 +29,15 @@ int main() {
   if (KSTDaemonStart(hooks) != 0) {
     Log::flush();
     return -1;
+  }
+  // The service manager's watchdog is answered from the main queue, twice per
+  // interval: when the main queue stops running, the answers stop and the
+  // service manager restarts the daemon.
+  std::unique_ptr<platform::Heartbeat> watchdog;
+  if (const auto interval = platform::serviceManagerWatchdogInterval(); interval.count() > 0) {
+    watchdog = platform::Heartbeat::start(platform::DispatchQueue::main(), interval / 2,
+                                          platform::notifyServiceManagerAlive);
+    if (!watchdog) KSTLogTag(kLogError, "main", "Failed to start the watchdog heartbeat");
   }
   const int status = platform::runMainLoop();
   Log::flush();

@@ -1,6 +1,7 @@
 // Facts about the running process and its threads, and how it ends when it must.
 #pragma once
 
+#include <chrono>
 #include <string>
 #include <string_view>
 #include <vector>
@@ -26,5 +27,12 @@ namespace kestrel::platform {
 // serve (READY=1), or that it is stopping (STOPPING=1).
 void notifyServiceManagerReady();
 void notifyServiceManagerStopping();
+
+// The time within which the service manager wants to hear that the daemon is
+// alive before it counts the daemon as hung and restarts it (systemd's
+// WatchdogSec=); zero when nothing watches the daemon.
+std::chrono::microseconds serviceManagerWatchdogInterval();
+// Tells the service manager that the daemon is alive (WATCHDOG=1).
+void notifyServiceManagerAlive();
 
 }  // namespace kestrel::platform

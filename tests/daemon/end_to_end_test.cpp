@@ -1,10 +1,19 @@
 // The real daemon on a scratch root, talked to by separate client processes
 // (copies of kestrelctl) that carry different registered identities.
 #include <gtest/gtest.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
 
+#include <algorithm>
+#include <chrono>
+#include <cstdlib>
+#include <cstring>
 #include <filesystem>
+#include <vector>
 
 #include "platform/linux/named_semaphores_linux.h"
+#include "platform/unique_fd.h"
 #include "support/registered_clients.h"
 
 namespace kestrel {
@@ -104,6 +113,45 @@ TEST_F(EndToEndTest, OnlyTheFirstStartSinceBootDoesTheBootTimeWork) {
   startAndStop();
   EXPECT_EQ(count("kestreld performing first boot initialization"), 2u);
   EXPECT_EQ(ctl("plain-client", {"reset-first-boot"}).output, "removed " + mark + "\n");
+}
+
+// As systemd runs it (Type=notify, WatchdogSec=): READY=1 once it serves,
+// WATCHDOG=1 from its main queue twice per interval, STOPPING=1 on SIGTERM.
+TEST_F(EndToEndTest, TellsTheServiceManagerItIsReadyAliveAndStopping) {
+  if (const char* wrapper = std::getenv("KESTREL_TEST_DAEMON_WRAPPER"); wrapper && *wrapper) {
+    GTEST_SKIP() << "a confined daemon answers the real service manager";
+  }
+  const std::string path = scratch.path() + "/notify";
+  platform::UniqueFd socket(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  ASSERT_LT(path.size(), sizeof address.sun_path);
+  std::memcpy(address.sun_path, path.c_str(), path.size());
+  ASSERT_EQ(::bind(socket.get(), reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+
+  std::vector<std::string> messages;
+  const auto receiveUntil = [&](auto done) {
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while (!done() && std::chrono::steady_clock::now() < deadline) {
+      pollfd ready{socket.get(), POLLIN, 0};
+      if (::poll(&ready, 1, 100) != 1) continue;
+      char buffer[4096];
+      const ssize_t n = ::recv(socket.get(), buffer, sizeof buffer, 0);
+      if (n > 0) messages.emplace_back(buffer, static_cast<std::size_t>(n));
+    }
+  };
+  const auto first = [&](const std::string& message) {
+    return std::find(messages.begin(), messages.end(), message) - messages.begin();
+  };
+
+  testing::DaemonProcess daemon(scratch.path(), {"NOTIFY_SOCKET=" + path, "WATCHDOG_USEC=200000"});
+  ASSERT_TRUE(daemon.ready());
+  receiveUntil([&] { return std::count(messages.begin(), messages.end(), "WATCHDOG=1") >= 3; });
+  EXPECT_GE(std::count(messages.begin(), messages.end(), "WATCHDOG=1"), 3);
+  EXPECT_LT(first("READY=1"), first("WATCHDOG=1"));  // the watchdog runs from readiness on
+  EXPECT_EQ(daemon.stop(), 0);
+  receiveUntil([&] { return first("STOPPING=1") < std::ssize(messages); });
+  EXPECT_LT(first("STOPPING=1"), std::ssize(messages));
 }
 
 }  // namespace

@@ -3,14 +3,21 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <spawn.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdlib>
+#include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <string_view>
 #include <thread>
+
+#include "platform/unique_fd.h"
 
 extern char** environ;
 
@@ -25,23 +32,54 @@ std::vector<char*> pointers(std::vector<std::string>& strings) {
   return result;
 }
 
+// This process's environment with the extra entries, which replace entries
+// of the same name.
 std::vector<std::string> environmentWith(const std::vector<std::string>& extra) {
+  auto replaced = [&](std::string_view entry) {
+    const std::string_view name = entry.substr(0, entry.find('=') + 1);
+    for (const auto& e : extra) {
+      if (e.starts_with(name)) return true;
+    }
+    return false;
+  };
   std::vector<std::string> env;
-  for (char** e = environ; *e != nullptr; ++e) env.emplace_back(*e);
+  for (char** e = environ; *e != nullptr; ++e) {
+    if (!replaced(*e)) env.emplace_back(*e);
+  }
   for (const auto& entry : extra) env.push_back(entry);
   return env;
 }
 
+// The process listening on a Unix socket, as the kernel recorded it; -1 when
+// it cannot be reached.
+pid_t listenerOf(const std::string& socketPath) {
+  platform::UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  if (!fd || socketPath.size() >= sizeof address.sun_path) return -1;
+  std::memcpy(address.sun_path, socketPath.c_str(), socketPath.size());
+  if (::connect(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return -1;
+  ucred peer{};
+  socklen_t length = sizeof peer;
+  if (::getsockopt(fd.get(), SOL_SOCKET, SO_PEERCRED, &peer, &length) != 0) return -1;
+  return peer.pid;
+}
+
 }  // namespace
 
-DaemonProcess::DaemonProcess(const std::string& root) {
+DaemonProcess::DaemonProcess(const std::string& root,
+                             const std::vector<std::string>& extraEnvironment) {
   const std::string socket = root + "/run/kestrel/com.zorvane.kestreld";
   ::unlink(socket.c_str());  // left by an earlier run: readiness is the new socket
+  const char* wrapper = std::getenv("KESTREL_TEST_DAEMON_WRAPPER");
   std::vector<std::string> args{KESTRELD_BINARY};
-  std::vector<std::string> env = environmentWith({"KESTREL_ROOT=" + root});
+  if (wrapper != nullptr && wrapper[0] != '\0') args.insert(args.begin(), wrapper);
+  std::vector<std::string> extra = extraEnvironment;
+  extra.push_back("KESTREL_ROOT=" + root);
+  std::vector<std::string> env = environmentWith(extra);
   auto argv = pointers(args);
   auto envp = pointers(env);
-  if (posix_spawn(&pid_, KESTRELD_BINARY, nullptr, nullptr, argv.data(), envp.data()) != 0) {
+  if (posix_spawn(&pid_, args[0].c_str(), nullptr, nullptr, argv.data(), envp.data()) != 0) {
     pid_ = -1;
     return;
   }
@@ -50,6 +88,7 @@ DaemonProcess::DaemonProcess(const std::string& root) {
   while (std::chrono::steady_clock::now() < deadline) {
     if (::stat(socket.c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) {
       ready_ = true;
+      daemonPid_ = wrapper != nullptr && wrapper[0] != '\0' ? listenerOf(socket) : pid_;
       return;
     }
     int status = 0;
@@ -71,6 +110,7 @@ int DaemonProcess::stop() {
   int status = 0;
   ::waitpid(pid_, &status, 0);
   pid_ = -1;
+  daemonPid_ = -1;
   return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 

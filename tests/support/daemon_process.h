@@ -11,19 +11,26 @@ namespace kestrel::testing {
 
 class DaemonProcess {
  public:
-  // Starts kestreld with KESTREL_ROOT=root and waits until its request socket exists.
-  explicit DaemonProcess(const std::string& root);
+  // Starts kestreld with KESTREL_ROOT=root (and the extra environment entries)
+  // and waits until its request socket exists. When KESTREL_TEST_DAEMON_WRAPPER
+  // names a program, that program is started with the daemon's path as its
+  // argument instead, so that it runs the daemon confined as the unit
+  // confines it (tools/confined-daemon.sh).
+  explicit DaemonProcess(const std::string& root,
+                         const std::vector<std::string>& extraEnvironment = {});
   ~DaemonProcess();
   DaemonProcess(const DaemonProcess&) = delete;
   DaemonProcess& operator=(const DaemonProcess&) = delete;
 
-  pid_t pid() const { return pid_; }
+  // The daemon's process (not the wrapper's, when there is one).
+  pid_t pid() const { return daemonPid_; }
   bool ready() const { return ready_; }
   // Sends SIGTERM and returns the exit status (or -1).
   int stop();
 
  private:
-  pid_t pid_ = -1;
+  pid_t pid_ = -1;  // the process started: the daemon or its wrapper
+  pid_t daemonPid_ = -1;
   bool ready_ = false;
 };
 

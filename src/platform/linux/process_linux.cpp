@@ -2,6 +2,7 @@
 #include <pthread.h>
 #include <unistd.h>
 
+#include <cstdint>
 #include <cstdlib>
 #include <memory>
 
@@ -52,5 +53,15 @@ namespace kestrel::platform {
 
 void notifyServiceManagerReady() { sd_notify(0, "READY=1"); }
 void notifyServiceManagerStopping() { sd_notify(0, "STOPPING=1"); }
+
+std::chrono::microseconds serviceManagerWatchdogInterval() {
+  // Also checks WATCHDOG_PID, so that a child that inherited the environment
+  // does not answer for its parent.
+  uint64_t usec = 0;
+  if (sd_watchdog_enabled(0, &usec) <= 0) return std::chrono::microseconds(0);
+  return std::chrono::microseconds(usec);
+}
+
+void notifyServiceManagerAlive() { sd_notify(0, "WATCHDOG=1"); }
 
 }  // namespace kestrel::platform
