@@ -567,7 +567,10 @@ int run(const Options& options) {
       } else {
         if (!trial.start(point)) throw std::runtime_error("the daemon did not start to crash");
         scenario->workload(trial, before);
-        if (!trial.killedWithin(20s)) problems.push_back("the workload did not reach " + point);
+        if (!trial.killedWithin(20s)) {
+          problems.push_back("the workload did not reach " + point);
+          trial.stop();
+        }
       }
       if (!trial.start()) throw std::runtime_error("the daemon did not start after the crash");
       scenario->check(trial, before, &problems);
