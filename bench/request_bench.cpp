@@ -10,7 +10,9 @@
 //             baseline runs twice, alternately, with and without the flushes
 //             that make a creation survive a power loss (every directory of
 //             the new container before the rename, the class directory and
-//             those above it after), which gives the price of durability.
+//             those above it after), which gives the price of durability;
+//   replace   command 2 of a transient container over a live one, against the
+//             same system calls in-process, with and without the flushes.
 //
 //   kestrel_request_bench --address unix:path=... --root R --out DIR [--seconds S]
 //                         [--only ping|lookup|reject]
@@ -56,6 +58,7 @@ constexpr std::uint64_t kUser = 501;
 constexpr std::uint64_t kClass = 2;  // Data/Application
 constexpr std::size_t kPopulation = 1000;
 constexpr std::size_t kCreations = 400;
+constexpr std::size_t kReplaces = 200;
 
 using Connection = kestrel::bench::DaemonConnection;
 
@@ -132,14 +135,66 @@ Phase runTimed(const std::string& name, const std::string& address, int clients,
 // directory of the new container before that rename and of the class
 // directory and the five above it (up to the root, as for a mobile user's
 // container) after it.
+//
+// And the same for a replace: the journal written atomically, the old
+// container parked in staging, the new one renamed into place and, when
+// durable, the three directories those renames changed flushed with those
+// above them; then staging and journal moved into death-row holders.
 class SyscallBaseline {
  public:
   explicit SyscallBaseline(const std::string& root)
       : root_(root),
         staging_(root + "/bench-baseline/Staging"),
-        live_(root + "/private/var/bench-baseline/Containers/Data/Application") {
-    fs::create_directories(staging_);
-    fs::create_directories(live_);
+        live_(root + "/private/var/bench-baseline/Containers/Data/Application"),
+        transient_(root + "/private/var/bench-baseline/Temp/Data/Application"),
+        journals_(root + "/bench-baseline/Replace"),
+        deathRow_(root + "/bench-baseline/Dead") {
+    for (const std::string& d : {staging_, live_, transient_, journals_, deathRow_}) {
+      fs::create_directories(d);
+    }
+  }
+
+  // An old container in place and a new one in the transient directory.
+  std::pair<std::string, std::string> prepareReplace() {
+    const std::string old = live_ + "/" + kestrel::platform::Uuid::random().string();
+    const std::string fresh = transient_ + "/" + kestrel::platform::Uuid::random().string();
+    for (const std::string& d : {old, fresh}) {
+      mkdirOwned(d);
+      mkdirOwned(d + "/Documents");
+    }
+    return {old, fresh};
+  }
+
+  void replaceOne(const std::pair<std::string, std::string>& containers, bool durable) {
+    const auto& [old, fresh] = containers;
+    const std::string id = kestrel::platform::Uuid::random().string();
+    const std::string parked = staging_ + "/" + id;
+    const std::string destination = live_ + "/" + fs::path(fresh).filename().string();
+    const std::string journal = journals_ + "/" + id + ".plist";
+    const kestrel::PlistDictionary paths{
+        {"KSTReplaceOperationOldURL", kestrel::PlistValue(old)},
+        {"KSTReplaceOperationNewURL", kestrel::PlistValue(fresh)},
+        {"KSTReplaceOperationStagingURL", kestrel::PlistValue(parked)},
+        {"KSTReplaceOperationDestURL", kestrel::PlistValue(destination)}};
+    writeAtomically(journal, *kestrel::platform::serializeBinaryPropertyList(
+                                 kestrel::PlistValue(paths), nullptr));
+    if (::rename(old.c_str(), parked.c_str()) != 0 ||
+        ::rename(fresh.c_str(), destination.c_str()) != 0) {
+      throw std::runtime_error("rename");
+    }
+    if (durable) {
+      for (const std::string& changed : {live_, staging_, transient_}) {
+        for (fs::path d = changed; d != root_; d = d.parent_path()) sync(d);
+      }
+    }
+    for (const std::string& item : {parked, journal}) {
+      std::string holder = deathRow_ + "/temp.XXXXXX";
+      if (::mkdtemp(holder.data()) == nullptr ||
+          ::rename(item.c_str(), (holder + "/" + fs::path(item).filename().string()).c_str()) !=
+              0) {
+        throw std::runtime_error("death row");
+      }
+    }
   }
 
   void createOne(std::size_t index, bool durable) {
@@ -202,6 +257,9 @@ class SyscallBaseline {
   fs::path root_;
   std::string staging_;
   std::string live_;
+  std::string transient_;
+  std::string journals_;
+  std::string deathRow_;
 };
 
 Phase timedLoop(const std::string& name, std::size_t count,
@@ -218,10 +276,10 @@ Phase timedLoop(const std::string& name, std::size_t count,
 }
 
 void printTable(const std::vector<Phase>& phases) {
-  std::printf("%-16s %7s %9s %10s %10s %10s %12s\n", "phase", "clients", "requests", "p50 us",
+  std::printf("%-26s %7s %9s %10s %10s %10s %12s\n", "phase", "clients", "requests", "p50 us",
               "p90 us", "p99 us", "per second");
   for (const Phase& p : phases) {
-    std::printf("%-16s %7d %9zu %10.1f %10.1f %10.1f %12.0f\n", p.name.c_str(), p.clients,
+    std::printf("%-26s %7d %9zu %10.1f %10.1f %10.1f %12.0f\n", p.name.c_str(), p.clients,
                 p.micros.size(), p.percentile(0.5), p.percentile(0.9), p.percentile(0.99),
                 p.throughput());
   }
@@ -324,6 +382,47 @@ int run(int argc, char** argv) {
     }
     phases.push_back(std::move(plain));
     phases.push_back(std::move(durable));
+
+    // Replaces: a live and a transient container of one identifier each,
+    // made beforehand; only the swap is timed.
+    std::vector<std::pair<kestrel::platform::Uuid, kestrel::platform::Uuid>> pairs;
+    for (std::size_t i = 0; i < kReplaces; ++i) {
+      const std::string identifier = identifierFor("com.example.swap.", i);
+      MessageDictionary old, fresh;
+      MessageDictionary transient = containerRequest(identifier, true);
+      transient.setBoolean("Transient", true);
+      if (connection.request(containerRequest(identifier, true), &old) != 1 ||
+          connection.request(transient, &fresh) != 1) {
+        throw std::runtime_error("replace preparation failed");
+      }
+      pairs.emplace_back(*old.uuid("ReplyUUID"), *fresh.uuid("ReplyUUID"));
+    }
+    phases.push_back(timedLoop("replace", kReplaces, [&](std::size_t i) {
+      MessageDictionary swap;
+      swap.setUint64("Command", 2);
+      swap.setUuid("OldContainerUUID", pairs[i].first);
+      swap.setUuid("NewContainerUUID", pairs[i].second);
+      for (const char* side : {"Old", "New"}) {
+        swap.setUint64(std::string(side) + "ContainerClass", kClass);
+        swap.setUint64(std::string(side) + "ContainerUserID", kUser);
+        swap.setString(std::string(side) + "Identifier", identifierFor("com.example.swap.", i));
+      }
+      if (connection.request(swap) != 1) throw std::runtime_error("replace failed");
+    }));
+    Phase plainReplace{"replace-syscalls", 1, {}, 0};
+    Phase durableReplace{"replace-syscalls-durable", 1, {}, 0};
+    for (std::size_t i = 0; i < kReplaces; ++i) {
+      for (Phase* phase : {&plainReplace, &durableReplace}) {
+        const auto containers = baseline.prepareReplace();
+        const auto t0 = Clock::now();
+        baseline.replaceOne(containers, phase == &durableReplace);
+        const double micros = std::chrono::duration<double, std::micro>(Clock::now() - t0).count();
+        phase->micros.push_back(micros);
+        phase->seconds += micros / 1e6;
+      }
+    }
+    phases.push_back(std::move(plainReplace));
+    phases.push_back(std::move(durableReplace));
   }
 
   fs::create_directories(out);
@@ -356,6 +455,11 @@ int run(int argc, char** argv) {
   // The daemon makes the durable calls, so that is its floor.
   ratios["create_p50_over_syscalls_p50"] =
       find("create", 1).percentile(0.5) / find("create-syscalls-durable", 1).percentile(0.5);
+  ratios["replace_p50_over_syscalls_p50"] =
+      find("replace", 1).percentile(0.5) / find("replace-syscalls-durable", 1).percentile(0.5);
+  ratios["durable_replace_syscalls_p50_over_plain_p50"] =
+      find("replace-syscalls-durable", 1).percentile(0.5) /
+      find("replace-syscalls", 1).percentile(0.5);
   ratios["durable_syscalls_p50_over_plain_syscalls_p50"] =
       find("create-syscalls-durable", 1).percentile(0.5) /
       find("create-syscalls", 1).percentile(0.5);
