@@ -137,6 +137,13 @@ class ExtendedACL {
   // link at path is never followed: ELOOP.
   virtual int setFile(const char* path, int type, const AccessControlList& acl) = 0;
 
+  // The same two for the item that fd refers to (a descriptor opened with
+  // O_PATH | O_NOFOLLOW, or any other): nothing is looked up by path, so
+  // nothing swapped in meanwhile is ever touched. ELOOP for a symbolic link
+  // (EOPNOTSUPP for a mode change), as above.
+  virtual int setDescriptor(int fd, int type, const AccessControlList& acl) = 0;
+  virtual int setModeKeepingACLDescriptor(int fd, mode_t mode) = 0;
+
   // The list set on the item at path, not following a symbolic link. ENOENT
   // when the item has none.
   virtual int getFile(const char* path, int type, AccessControlList* acl) const = 0;

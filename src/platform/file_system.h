@@ -45,6 +45,17 @@ int makePath(const char* path, mode_t mode);
 // part already copied is left in place.
 int copyTree(const char* from, const char* to);
 
+// --- Confined resolution -------------------------------------------------------------------
+
+// Opens relativePath beneath the directory baseFd with flags (O_CLOEXEC is
+// added): the resolution may never leave that directory, by "..", an
+// absolute or escaping symbolic link, a magic link or a mount point
+// (openat2 with RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV),
+// whatever is renamed or swapped meanwhile. An empty relativePath opens
+// baseFd's directory itself. EXDEV or ELOOP for a path that would leave it,
+// ENOSYS on a kernel without openat2.
+int openBeneath(int baseFd, const char* relativePath, int flags, int* fd);
+
 // --- File flags ----------------------------------------------------------------------------
 
 // The immutable flag: the file cannot be changed, renamed or unlinked while it

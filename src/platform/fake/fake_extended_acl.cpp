@@ -1,5 +1,7 @@
 #include "platform/fake/fake_extended_acl.h"
 
+#include <unistd.h>
+
 #include <sys/stat.h>
 
 #include <cerrno>
@@ -160,6 +162,30 @@ int FakeExtendedACL::setModeKeepingACL(const char* path, mode_t mode) {
   std::lock_guard lock(mutex_);
   modeChanges_.emplace_back(path, mode);
   return 0;
+}
+
+namespace {
+
+// The path a descriptor's item has now; empty when it has none.
+std::string pathOfDescriptor(int fd) {
+  std::string path(4096, '\0');
+  const std::string link = "/proc/self/fd/" + std::to_string(fd);
+  const ssize_t n = ::readlink(link.c_str(), path.data(), path.size());
+  if (n <= 0) return {};
+  path.resize(static_cast<std::size_t>(n));
+  return path;
+}
+
+}  // namespace
+
+int FakeExtendedACL::setDescriptor(int fd, int type, const AccessControlList& acl) {
+  const std::string path = pathOfDescriptor(fd);
+  return path.empty() ? EBADF : setFile(path.c_str(), type, acl);
+}
+
+int FakeExtendedACL::setModeKeepingACLDescriptor(int fd, mode_t mode) {
+  const std::string path = pathOfDescriptor(fd);
+  return path.empty() ? EBADF : setModeKeepingACL(path.c_str(), mode);
 }
 
 }  // namespace kestrel::platform

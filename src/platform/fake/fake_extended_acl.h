@@ -58,6 +58,9 @@ class FakeExtendedACL final : public ExtendedACL {
   int setFile(const char* path, int type, const AccessControlList& acl) override;
   int getFile(const char* path, int type, AccessControlList* acl) const override;
   int setModeKeepingACL(const char* path, mode_t mode) override;
+  // By the path the descriptor's item has now.
+  int setDescriptor(int fd, int type, const AccessControlList& acl) override;
+  int setModeKeepingACLDescriptor(int fd, mode_t mode) override;
 
  private:
   struct Failure {

@@ -42,13 +42,24 @@ struct OpenedItem {
   std::string path;  // "/proc/self/fd/N"
 };
 
-int openItem(const char* path, OpenedItem* item) {
-  if (path == nullptr) return EINVAL;
-  item->fd = UniqueFd(::open(path, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+int describeItem(OpenedItem* item) {
   if (!item->fd) return errno;
   if (::fstat(item->fd.get(), &item->st) != 0) return errno;
   item->path = "/proc/self/fd/" + std::to_string(item->fd.get());
   return 0;
+}
+
+int openItem(const char* path, OpenedItem* item) {
+  if (path == nullptr) return EINVAL;
+  item->fd = UniqueFd(::open(path, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+  return describeItem(item);
+}
+
+// The item of a descriptor the caller keeps: a copy of its own.
+int adoptItem(int fd, OpenedItem* item) {
+  if (fd < 0) return EBADF;
+  item->fd = UniqueFd(::fcntl(fd, F_DUPFD_CLOEXEC, 0));
+  return describeItem(item);
 }
 
 int setEntryPermissions(acl_entry_t entry, unsigned bits) {
@@ -221,11 +232,12 @@ int LinuxExtendedACL::lookupGroupUUID(std::string_view groupName, Uuid* uuid) co
   return 0;
 }
 
-int LinuxExtendedACL::setFile(const char* path, int type, const AccessControlList& acl) {
+namespace {
+
+int checkList(int type, const AccessControlList& acl, std::vector<gid_t>* gids) {
   if (type != kACLTypeExtended) return EINVAL;
   // Everything the kernel cannot be told is refused before the item is touched.
-  std::vector<gid_t> gids;
-  gids.reserve(acl.entries.size());
+  gids->reserve(acl.entries.size());
   for (const AccessControlEntry& entry : acl.entries) {
     if (entry.tag == kACLTagExtendedDeny) return EOPNOTSUPP;
     if (entry.tag != kACLTagExtendedAllow) return EINVAL;
@@ -234,11 +246,13 @@ int LinuxExtendedACL::setFile(const char* path, int type, const AccessControlLis
     }
     const std::optional<gid_t> gid = gidOfGroupMembershipUUID(entry.qualifier);
     if (!gid) return EINVAL;
-    gids.push_back(*gid);
+    gids->push_back(*gid);
   }
+  return 0;
+}
 
-  OpenedItem item;
-  if (const int failure = openItem(path, &item); failure != 0) return failure;
+int setOnItem(const OpenedItem& item, const AccessControlList& acl,
+              const std::vector<gid_t>& gids) {
   if (S_ISLNK(item.st.st_mode)) return ELOOP;
   const bool isDirectory = S_ISDIR(item.st.st_mode);
 
@@ -251,16 +265,18 @@ int LinuxExtendedACL::setFile(const char* path, int type, const AccessControlLis
   for (std::size_t i = 0; i < acl.entries.size(); ++i) {
     const AccessControlEntry& entry = acl.entries[i];
     if ((entry.flags & kACLEntryInheritOnly) == 0) {
-      access.groups[gids[i]] |= posixPermissionsFor(entry.permissions, isDirectory);
-      sticky = sticky || (isDirectory && addsWithoutDeletingChildren(entry.permissions));
+      access.groups[gids[i]] |=
+          LinuxExtendedACL::posixPermissionsFor(entry.permissions, isDirectory);
+      sticky = sticky ||
+               (isDirectory && LinuxExtendedACL::addsWithoutDeletingChildren(entry.permissions));
     }
     if (!isDirectory) continue;
     unsigned bits = 0;
     if ((entry.flags & kACLEntryFileInherit) != 0) {
-      bits |= posixPermissionsFor(entry.permissions, false);
+      bits |= LinuxExtendedACL::posixPermissionsFor(entry.permissions, false);
     }
     if ((entry.flags & kACLEntryDirectoryInherit) != 0) {
-      bits |= posixPermissionsFor(entry.permissions, true);
+      bits |= LinuxExtendedACL::posixPermissionsFor(entry.permissions, true);
     }
     if (bits != 0) {
       inherited.groups[gids[i]] |= bits;
@@ -289,6 +305,24 @@ int LinuxExtendedACL::setFile(const char* path, int type, const AccessControlLis
   return writeRecord(item.path, acl);
 }
 
+}  // namespace
+
+int LinuxExtendedACL::setFile(const char* path, int type, const AccessControlList& acl) {
+  std::vector<gid_t> gids;
+  if (const int failure = checkList(type, acl, &gids); failure != 0) return failure;
+  OpenedItem item;
+  if (const int failure = openItem(path, &item); failure != 0) return failure;
+  return setOnItem(item, acl, gids);
+}
+
+int LinuxExtendedACL::setDescriptor(int fd, int type, const AccessControlList& acl) {
+  std::vector<gid_t> gids;
+  if (const int failure = checkList(type, acl, &gids); failure != 0) return failure;
+  OpenedItem item;
+  if (const int failure = adoptItem(fd, &item); failure != 0) return failure;
+  return setOnItem(item, acl, gids);
+}
+
 int LinuxExtendedACL::getFile(const char* path, int type, AccessControlList* acl) const {
   if (path == nullptr || acl == nullptr || type != kACLTypeExtended) return EINVAL;
   return readRecord(path, false, acl);
@@ -306,9 +340,9 @@ bool LinuxExtendedACL::recordNeedsStickyBit(const std::string& itemPath) {
   return false;
 }
 
-int LinuxExtendedACL::setModeKeepingACL(const char* path, mode_t mode) {
-  OpenedItem item;
-  if (const int failure = openItem(path, &item); failure != 0) return failure;
+namespace {
+
+int setModeOnItem(const OpenedItem& item, mode_t mode) {
   if (S_ISLNK(item.st.st_mode)) return EOPNOTSUPP;
   const char* itemPath = item.path.c_str();
 
@@ -351,9 +385,23 @@ int LinuxExtendedACL::setModeKeepingACL(const char* path, mode_t mode) {
   struct stat st {};
   if (::fstat(item.fd.get(), &st) != 0) return errno;
   mode_t wanted = (mode & 07000) | (st.st_mode & 0777);
-  if (S_ISDIR(st.st_mode) && recordNeedsStickyBit(item.path)) wanted |= S_ISVTX;
+  if (S_ISDIR(st.st_mode) && LinuxExtendedACL::recordNeedsStickyBit(item.path)) wanted |= S_ISVTX;
   if ((st.st_mode & 07777) != wanted && ::chmod(itemPath, wanted) != 0) return errno;
   return 0;
+}
+
+}  // namespace
+
+int LinuxExtendedACL::setModeKeepingACL(const char* path, mode_t mode) {
+  OpenedItem item;
+  if (const int failure = openItem(path, &item); failure != 0) return failure;
+  return setModeOnItem(item, mode);
+}
+
+int LinuxExtendedACL::setModeKeepingACLDescriptor(int fd, mode_t mode) {
+  OpenedItem item;
+  if (const int failure = adoptItem(fd, &item); failure != 0) return failure;
+  return setModeOnItem(item, mode);
 }
 
 }  // namespace kestrel::platform

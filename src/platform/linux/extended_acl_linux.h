@@ -118,6 +118,8 @@ class LinuxExtendedACL final : public ExtendedACL {
   int setFile(const char* path, int type, const AccessControlList& acl) override;
   int getFile(const char* path, int type, AccessControlList* acl) const override;
   int setModeKeepingACL(const char* path, mode_t mode) override;
+  int setDescriptor(int fd, int type, const AccessControlList& acl) override;
+  int setModeKeepingACLDescriptor(int fd, mode_t mode) override;
 
   // The rwx bits (4, 2, 1) that the permission bits grant on a file or a directory.
   static unsigned posixPermissionsFor(std::uint32_t permissions, bool isDirectory);
@@ -125,9 +127,10 @@ class LinuxExtendedACL final : public ExtendedACL {
   // directory, write plus the sticky bit.
   static bool addsWithoutDeletingChildren(std::uint32_t permissions);
 
- private:
+  // Whether the record of the item at the /proc/self/fd path asks for the sticky bit.
   static bool recordNeedsStickyBit(const std::string& itemPath);
 
+ private:
   std::shared_ptr<const Accounts> accounts_;
 };
 
