@@ -3,16 +3,20 @@
 // every container of a class directory.
 #include "codesigning/system_container_acls.h"
 
+#include <dirent.h>
+#include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
+#include <memory>
 #include <string>
 #include <system_error>
 
 #include "daemon/log.h"
 #include "platform/services.h"
+#include "platform/unique_fd.h"
 #include "store/file_manager.h"
 
 namespace kestrel {
@@ -152,8 +156,122 @@ bool KSTFileManager::setTopLevelSystemContainerACLAtURL(const KSTFileURL& url,
   return true;
 }
 
-bool KSTFileManager::standardizeACLsAtURL(const KSTFileURL& url, bool isSystemContainer,
-                                          KSTErrorRef* error) const {
+namespace {
+
+constexpr const char* kStandardizeTag = "standardizeACLsAtURL";
+// Deeper than this a tree is not walked on (every level holds a directory open).
+constexpr int kMaxStandardizeDepth = 256;
+
+struct DirCloser {
+  void operator()(DIR* dir) const { ::closedir(dir); }
+};
+
+// The three lists of a tree and where they go, applied item by item through
+// descriptors: the walk never resolves a path beneath its starting item.
+class TreeStandardizer {
+ public:
+  TreeStandardizer(platform::ExtendedACL& service, const platform::AccessControlList& topLevel,
+                   const platform::AccessControlList& directory,
+                   const platform::AccessControlList& file, bool isSystemContainer)
+      : service_(service),
+        topLevel_(topLevel),
+        directory_(directory),
+        file_(file),
+        isSystemContainer_(isSystemContainer) {}
+
+  // Walks the item `name` of the directory parentFd; false (with the walk's
+  // error) only when the item itself cannot be opened.
+  bool run(int parentFd, const std::string& name, const std::string& path, KSTErrorRef* error) {
+    platform::UniqueFd item(::openat(parentFd, name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    struct stat st {};
+    if (!item || ::fstat(item.get(), &st) != 0) {
+      const int opened = errno;
+      KSTSetError(
+          error, KST_POSIX_ERROR_IN(kStandardizeTag, opened, "fts_open failed for %s with error %s",
+                                    path, errnoText(opened)));
+      return false;
+    }
+    device_ = st.st_dev;
+    visit(item, st, name, path, 0);
+    return true;
+  }
+
+ private:
+  void visit(const platform::UniqueFd& item, const struct stat& st, const std::string& name,
+             const std::string& path, int level) {
+    // The metadata file, or anything beneath an item of its name, is left alone.
+    if (name.find(kMetadataFileName) != std::string::npos) return;
+    // A symbolic link carries no list and no mode of its own here, and is
+    // never followed to what it names.
+    if (S_ISLNK(st.st_mode)) return;
+    const bool isTopLevel = isSystemContainer_ && level == 0;
+    const bool isDirectory = S_ISDIR(st.st_mode);
+    const platform::AccessControlList& acl =
+        isDirectory ? (isTopLevel ? topLevel_ : directory_) : file_;
+    if (const int e = service_.setDescriptor(item.get(), platform::kACLTypeExtended, acl); e != 0) {
+      KSTLogTag(kLogError, kStandardizeTag,
+                isTopLevel ? "Failed to set top level ACL on dir %s: %s"
+                           : "Failed to set ACL on dir %s: %s",
+                path, errnoText(e));
+    }
+    // The top directory of a system container keeps its mode and owner.
+    if (!isTopLevel) {
+      if (const int e = service_.setModeKeepingACLDescriptor(item.get(), 0); e != 0) {
+        KSTLogTag(kLogError, kStandardizeTag, "Could not chmod %s: %s", path, errnoText(e));
+      }
+      if (::fchownat(item.get(), "", kKSTSystemContainerItemOwner, kKSTSystemContainerItemGroup,
+                     AT_EMPTY_PATH | AT_SYMLINK_NOFOLLOW) != 0) {
+        KSTLogTag(kLogError, kStandardizeTag, "Could not chown %s: %s", path, errnoText(errno));
+      }
+    }
+    // Another file system is not entered.
+    if (isDirectory && st.st_dev == device_) visitChildren(item, path, level);
+  }
+
+  void visitChildren(const platform::UniqueFd& item, const std::string& path, int level) {
+    if (level >= kMaxStandardizeDepth) {
+      KSTLogTag(kLogError, kStandardizeTag, "Error for path %s: %s", path, errnoText(ELOOP));
+      return;
+    }
+    const int listed = ::openat(item.get(), ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    std::unique_ptr<DIR, DirCloser> directory(listed >= 0 ? ::fdopendir(listed) : nullptr);
+    if (!directory) {
+      if (listed >= 0) ::close(listed);
+      KSTLogTag(kLogError, kStandardizeTag, "Error for path %s: %s", path, errnoText(errno));
+      return;
+    }
+    const int dirFd = ::dirfd(directory.get());
+    while (const struct dirent* entry = ::readdir(directory.get())) {
+      const std::string child = entry->d_name;
+      if (child == "." || child == "..") continue;
+      const std::string childPath = path + "/" + child;
+      platform::UniqueFd childItem(::openat(dirFd, child.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+      struct stat childSt {};
+      if (!childItem || ::fstat(childItem.get(), &childSt) != 0) {
+        // Gone meanwhile: nothing left to standardize.
+        if (errno != ENOENT) {
+          KSTLogTag(kLogError, kStandardizeTag, "Error for path %s: %s", childPath,
+                    errnoText(errno));
+        }
+        continue;
+      }
+      visit(childItem, childSt, child, childPath, level + 1);
+    }
+  }
+
+  platform::ExtendedACL& service_;
+  const platform::AccessControlList& topLevel_;
+  const platform::AccessControlList& directory_;
+  const platform::AccessControlList& file_;
+  const bool isSystemContainer_;
+  dev_t device_ = 0;
+};
+
+}  // namespace
+
+bool KSTFileManager::standardizeACLsBeneath(int parentFd, const std::string& name,
+                                            bool isSystemContainer, const std::string& displayPath,
+                                            KSTErrorRef* error) const {
   const std::optional<platform::AccessControlList> topLevelACL =
       _copyTopLevelSystemContainerACL(error);
   if (!topLevelACL) return false;
@@ -163,47 +281,24 @@ bool KSTFileManager::standardizeACLsAtURL(const KSTFileURL& url, bool isSystemCo
   const std::optional<platform::AccessControlList> fileACL =
       _copySystemContainerACLWithNumACEs(1, false, false, error);
   if (!fileACL) return false;
+  TreeStandardizer walk(*aclService(), *topLevelACL, *directoryACL, *fileACL, isSystemContainer);
+  return walk.run(parentFd, name, displayPath, error);
+}
 
-  platform::ExtendedACL& service = *aclService();
-  return _traverseDirectory(url, error, [&](FTSENT* entry, KSTErrorRef*) {
-    // A directory is done on its first visit; the second, after its contents,
-    // has nothing left to do.
-    if (entry->fts_info == FTS_DP) return true;
-    const char* path = entry->fts_path;
-    if (std::strstr(path, kMetadataFileName) != nullptr) return true;
-    const mode_t mode = entry->fts_statp->st_mode;
-    // A symbolic link carries no list and no mode of its own here, and is
-    // never followed to what it names.
-    if (S_ISLNK(mode)) return true;
-    const bool isTopLevel = isSystemContainer && entry->fts_level == FTS_ROOTLEVEL;
-
-    if (S_ISDIR(mode)) {
-      if (isTopLevel) {
-        if (const int e = service.setFile(path, platform::kACLTypeExtended, *topLevelACL); e != 0) {
-          KSTLogTag(kLogError, "standardizeACLsAtURL", "Failed to set top level ACL on dir %s: %s",
-                    path, errnoText(e));
-        }
-      } else if (const int e = service.setFile(path, platform::kACLTypeExtended, *directoryACL);
-                 e != 0) {
-        KSTLogTag(kLogError, "standardizeACLsAtURL", "Failed to set ACL on dir %s: %s", path,
-                  errnoText(e));
-      }
-    } else if (const int e = service.setFile(path, platform::kACLTypeExtended, *fileACL); e != 0) {
-      KSTLogTag(kLogError, "standardizeACLsAtURL", "Failed to set ACL on dir %s: %s", path,
-                errnoText(e));
-    }
-    // The top directory of a system container keeps its mode and owner.
-    if (isTopLevel) return true;
-
-    if (const int e = service.setModeKeepingACL(path, 0); e != 0) {
-      KSTLogTag(kLogError, "standardizeACLsAtURL", "Could not chmod %s: %s", path, errnoText(e));
-    }
-    if (::lchown(path, kKSTSystemContainerItemOwner, kKSTSystemContainerItemGroup) != 0) {
-      KSTLogTag(kLogError, "standardizeACLsAtURL", "Could not chown %s: %s", path,
-                errnoText(errno));
-    }
-    return true;
-  });
+bool KSTFileManager::standardizeACLsAtURL(const KSTFileURL& url, bool isSystemContainer,
+                                          KSTErrorRef* error) const {
+  // Only the item's own directory is looked up by path; the walk beneath it
+  // goes by descriptors.
+  const KSTFileURL parent = url.deletingLastPathComponent();
+  const platform::UniqueFd parentFd(
+      ::open(parent.fileSystemRepresentation(), O_PATH | O_DIRECTORY | O_CLOEXEC));
+  if (!parentFd) {
+    const int opened = errno;
+    return fail(error, KST_POSIX_ERROR(opened, "fts_open failed for %s with error %s", url.path(),
+                                       errnoText(opened)));
+  }
+  return standardizeACLsBeneath(parentFd.get(), url.lastPathComponent(), isSystemContainer,
+                                url.path(), error);
 }
 
 bool KSTFileManager::standardizeACLsForSystemContainerAtURL(const KSTFileURL& url,

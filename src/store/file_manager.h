@@ -119,6 +119,25 @@ class KSTFileManager {
   // Logs every item of the tree at error level (used for orphaned data).
   void printDirectoryStructureAtURL(const KSTFileURL& url) const;
 
+  // --- Path confinement (store/path_confinement.cpp) ---
+
+  // The real path of url when it lies within ifChildOfURL once links and the
+  // "/private" alias are resolved; nothing (logged) otherwise. No ".." is
+  // accepted, a link at url itself only with a relative target that stays
+  // within the base by its own components, and a path that does not exist
+  // yet by its longest existing leading part.
+  std::optional<KSTFileURL> realPathForURL(const std::optional<KSTFileURL>& url,
+                                           const std::optional<KSTFileURL>& ifChildOfURL) const;
+  // realpath(3); with allowNonExistentPathComponents, a missing tail is
+  // joined onto the real path of what exists.
+  std::optional<KSTFileURL> _realPathForURL(const KSTFileURL& url,
+                                            bool allowNonExistentPathComponents) const;
+  std::optional<KSTFileURL> _realPathWhatExistsInPath(const std::string& path) const;
+  // Walks the components keeping a depth ("..": one down, a name: one up);
+  // false as soon as it falls below the start.
+  bool _validateSymlink(const std::optional<std::string>& path, std::int32_t withStartingDepth,
+                        std::int32_t* andEndingDepth) const;
+
   // --- Access-control lists of system containers (codesigning/system_container_acls.cpp) ---
   // Each fails with error 63 naming the call that failed.
 
@@ -141,6 +160,13 @@ class KSTFileManager {
   bool standardizeACLsAtURL(const KSTFileURL& url, bool isSystemContainer,
                             KSTErrorRef* error) const;
   bool standardizeACLsForSystemContainerAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
+  // The same for the item named `name` in the open directory parentFd and
+  // everything beneath it, reached through descriptors only: no path is
+  // resolved again, no link followed, no other file system entered, so a
+  // component swapped for a link meanwhile leads nowhere. displayPath names
+  // the item in log lines.
+  bool standardizeACLsBeneath(int parentFd, const std::string& name, bool isSystemContainer,
+                              const std::string& displayPath, KSTErrorRef* error) const;
   // The above for every item of a class directory; a missing directory is success.
   bool standardizeAllSystemContainerACLsAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
 
