@@ -9,6 +9,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "daemon/errors.h"
 #include "platform/plist.h"
@@ -68,5 +69,8 @@ bool KST_writeToURL(const PlistDictionary& dictionary, const KSTFileURL& url,
 // its first NUL byte. A null pointer gives an empty string.
 std::string stringWithFileSystemRepresentation(const char* bytes, std::size_t length);
 std::string stringWithFileSystemRepresentation(const char* bytes);
+
+// Whether any path component of the string is "..".
+bool KSTContainsDotDotPathComponents(std::string_view path);
 
 }  // namespace kestrel
