@@ -122,6 +122,17 @@ class KSTClientConnection {
                                          KSTContainerClass containerClass,
                                          std::uint64_t* withError);
 
+  // Shared-content staging (operations/shared_content.cpp): moves the item
+  // at sourceRelativePath of the system group container `identifier` (which
+  // the client must be entitled to) to destRelativePath in it, after
+  // resetting its ACLs. Both paths must stay within the container, and the
+  // ACL reset and the move act through descriptors beneath it. The
+  // destination URL, or nothing with 10, 11, 21, 38, 55, 63 or 64.
+  std::optional<KSTFileURL> stageSharedContentForIdentifier(
+      const std::optional<std::string>& identifier,
+      const std::optional<std::string>& sourceRelativePath,
+      const std::optional<std::string>& destRelativePath, std::uint64_t* withError);
+
   // Start-up and boot housekeeping of the container store.
   void rebootContainerManagerSetup();
   void containerManagerSetup();

@@ -46,6 +46,9 @@ void KSTHandleGetCodeSigningInfo(KSTCommandContext& context);
 // 20: invalidates the code-signing information of apps without a bundle container.
 void KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer(KSTCommandContext& context);
 
+// 26: stages shared content inside a system group container.
+void KSTHandleStageSharedContent(KSTCommandContext& context);
+
 // 25: the retry test, on internal builds only.
 void KSTHandleRetryTest(KSTCommandContext& context);
 

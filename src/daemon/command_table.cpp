@@ -20,7 +20,7 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {9, nullptr, kKSTEntitlementAllowed, 1},                    // give a container a new UUID
       {10, KSTHandleDeleteContainer, kKSTEntitlementAllowed, 1},  // delete a container
       {11, KSTHandleWipePluginContainer, kKSTEntitlementWipeContainer,
-       1},                                              // wipe a plug-in data container
+       1},                                                      // wipe a plug-in data container
       {12, KSTHandleWipeContainer, kKSTEntitlementAllowed, 1},  // delete a data container's content
       {13, KSTHandleAppGroupContainerPaths, kKSTEntitlementNone,
        1},  // the client's app-group paths
@@ -41,7 +41,8 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {23, nullptr, kKSTEntitlementAllowed, 1},             // measure disk usage
       {24, nullptr, kKSTEntitlementDataMigration, 1},       // the data-migration migration
       {25, KSTHandleRetryTest, kKSTEntitlementAllowed, 1},  // retry test (internal builds)
-      {26, nullptr, kKSTEntitlementStageSharedContent, 1},  // stage shared content
+      {26, KSTHandleStageSharedContent, kKSTEntitlementStageSharedContent,
+       1},  // stage shared content
   }};
   return table;
 }

@@ -85,6 +85,34 @@ TEST_F(ContainerEndToEndTest, AppGetsItsOwnContainersAndTheInstallerListsThem) {
   EXPECT_EQ(daemon.stop(), 0);
 }
 
+// Command 26 moves an item within a system group container, and refuses a
+// path that leads out through a link the client made.
+TEST_F(ContainerEndToEndTest, StagedContentStaysInItsSystemGroupContainer) {
+  registerClient("stager", "com.example.stager",
+                 "<key>com.zorvane.private.Kestrel.stageSharedContent</key><true/>"
+                 "<key>com.zorvane.security.system-groups</key>"
+                 "<array><string>systemgroup.com.example.shared</string></array>");
+  testing::DaemonProcess daemon(scratch.path());
+  ASSERT_TRUE(daemon.ready());
+  auto made = call("stager", {"17", "GroupIdentifier=str:systemgroup.com.example.shared"});
+  ASSERT_EQ(made.exitStatus, 0) << made.output;
+  const std::string key = "\"ReplyPath\": \"";
+  const std::size_t start = made.output.find(key) + key.size();
+  const std::string group = made.output.substr(start, made.output.find('"', start) - start);
+  std::ofstream(group + "/item") << "x";
+  fs::create_symlink("/etc", group + "/etc");
+  const auto stage = [&](const std::string& source, const std::string& dest) {
+    return call("stager", {"26", "Identifier=str:systemgroup.com.example.shared",
+                           "SourcePath=str:" + source, "DestPath=str:" + dest});
+  };
+  EXPECT_EQ(stage("item", "staged").exitStatus, 0);
+  EXPECT_TRUE(fs::exists(group + "/staged"));
+  auto escaped = stage("etc/passwd", "stolen");
+  EXPECT_NE(escaped.output.find("\"ReplyError\": 10"), std::string::npos) << escaped.output;
+  EXPECT_FALSE(fs::exists(group + "/stolen"));
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
 // The system calls of one creation, watched from outside with strace: the
 // whole container reaches the disk before the rename that makes it live, and
 // the class directory after it, before the reply.
