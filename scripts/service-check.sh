@@ -73,7 +73,15 @@ for _ in $(seq 100); do
 done
 [[ -n $init ]] || { cat "$work/console.log"; fail "the container did not boot"; }
 inside() { nsenter --target "$init" --all -- env -C / "$@"; }
-inside systemctl is-system-running --wait >/dev/null || true
+# Until its manager answers and has finished booting (its /tmp, its bus): on a
+# busy machine that takes a while after PID 1 appears.
+for _ in $(seq 240); do
+  state=$(inside systemctl is-system-running 2>/dev/null || true)
+  [[ $state == running || $state == degraded ]] && break
+  sleep 0.5
+done
+[[ $state == running || $state == degraded ]] ||
+  { cat "$work/console.log"; fail "the container did not finish booting ($state)"; }
 
 say "apt install ./$(basename "$deb")"
 inside apt-get update -qq
