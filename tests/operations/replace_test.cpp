@@ -69,48 +69,42 @@ TEST_F(ReplaceTest, RefusalsLeaveDiskAndCacheAsTheyWere) {
   // Something already where the new one would go.
   const std::string occupied =
       testing::classDirectory(501, 2) + "/" + fs::path(other->url().path()).filename().string();
+  // Old and new as the request names them: a container's UUID, user, class
+  // and identifier; a missing old one names none.
+  struct Side {
+    std::optional<Uuid> uuid;
+    std::uint32_t user;
+    KSTContainerClass containerClass;
+    std::optional<std::string> identifier;
+  };
+  const auto side = [](const KSTMetadataRef& c) {
+    return Side{c->uuid(), c->uid(), c->containerClass(), c->identifier()};
+  };
+  const Side none{std::nullopt, 0, 0, std::nullopt};
   struct Row {
     const char* label;
-    std::function<void(std::uint64_t*)> call;
+    Side old, fresh;
+    bool preserve;
     std::uint64_t code;
   } rows[] = {
-      {"no new UUID",
-       [&](auto* c) {
-         installer.replaceContainer(old->uuid(), std::nullopt, 501, 501, kApp, kApp, 2, 2, false,
-                                    false, c);
-       },
-       kKSTErrorInvalidObject},
-      {"old class 0",
-       [&](auto* c) {
-         installer.replaceContainer(old->uuid(), fresh->uuid(), 501, 501, kApp, kApp, 0, 2, false,
-                                    false, c);
-       },
-       kKSTErrorInvalidObject},
-      {"preserving without an old UUID",
-       [&](auto* c) {
-         installer.replaceContainer(std::nullopt, fresh->uuid(), 0, 501, std::nullopt, kApp, 0, 2,
-                                    true, false, c);
-       },
-       kKSTErrorInvalidObject},
-      {"classes differ", [&](auto* c) { *c = replace(old, group); }, kKSTErrorClassMismatch},
-      {"users differ", [&](auto* c) { *c = replace(old, otherUser); }, kKSTErrorUserMismatch},
-      {"old not cached",
-       [&](auto* c) {
-         installer.replaceContainer(unknown, fresh->uuid(), 501, 501, kApp, kApp, 2, 2, false,
-                                    false, c);
-       },
-       kKSTErrorNotFound},
-      {"same container", [&](auto* c) { *c = replace(old, old); }, kKSTErrorReplaceSameContainer},
-      {"directory name not a UUID", [&](auto* c) { *c = replace(nullptr, system); },
-       kKSTErrorInvalidURL},
-      {"a live container of the identifier, without old",
-       [&](auto* c) { *c = replace(nullptr, fresh); }, kKSTErrorAlreadyExists},
-      {"destination occupied", [&](auto* c) { *c = replace(old, other); }, kKSTErrorAlreadyExists},
+      {"no new UUID", side(old), {std::nullopt, 501, 2, kApp}, false, kKSTErrorInvalidObject},
+      {"old class 0", {old->uuid(), 501, 0, kApp}, side(fresh), false, kKSTErrorInvalidObject},
+      {"preserving without an old UUID", none, side(fresh), true, kKSTErrorInvalidObject},
+      {"classes differ", side(old), side(group), false, kKSTErrorClassMismatch},
+      {"users differ", side(old), side(otherUser), false, kKSTErrorUserMismatch},
+      {"old not cached", {unknown, 501, 2, kApp}, side(fresh), false, kKSTErrorNotFound},
+      {"same container", side(old), side(old), false, kKSTErrorReplaceSameContainer},
+      {"directory name not a UUID", none, side(system), false, kKSTErrorInvalidURL},
+      {"a live container of the identifier, without old", none, side(fresh), false,
+       kKSTErrorAlreadyExists},
+      {"destination occupied", side(old), side(other), false, kKSTErrorAlreadyExists},
   };
   for (const Row& row : rows) {
     SCOPED_TRACE(row.label);
     std::uint64_t code = kKSTSuccess;
-    row.call(&code);
+    installer.replaceContainer(row.old.uuid, row.fresh.uuid, row.old.user, row.fresh.user,
+                               row.old.identifier, row.fresh.identifier, row.old.containerClass,
+                               row.fresh.containerClass, row.preserve, false, &code);
     EXPECT_EQ(code, row.code);
     for (const KSTMetadataRef& c : {old, fresh, other}) {
       EXPECT_TRUE(fs::is_directory(c->url().path())) << c->url().path();

@@ -4,8 +4,6 @@
 // nothing it mounts is seen outside it or outlives it.
 #pragma once
 
-#include <sys/types.h>
-
 #include <cstddef>
 #include <string>
 
@@ -29,7 +27,7 @@ class TmpfsMount {
  private:
   std::string path_;
   std::string error_;
-  dev_t device_ = 0;
+  std::string source_;
   bool mounted_ = false;
 };
 
