@@ -78,7 +78,7 @@ max_len_for() {
     return
   fi
   case "$1" in
-    fuzz_request_decoding | fuzz_dbus_message_codec) echo 1024 ;;
+    fuzz_request_decoding | fuzz_dbus_message_codec | fuzz_path_confinement) echo 1024 ;;
     *) echo 4096 ;;
   esac
 }
