@@ -28,7 +28,6 @@
 namespace {
 
 using namespace kestrel;
-using kestrel::fuzz::fail;
 
 // The sandbox's table would keep an item for every identifier ever made.
 class DiscardingSandbox final : public platform::Sandbox {

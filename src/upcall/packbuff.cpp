@@ -62,6 +62,7 @@ PackbuffRef newHandle() {
 void releaseBuffer(const packbuff& handle) {
   switch (handle.dealloc_type) {
     case kSBPackbuffDeallocFree:
+      // NOLINTNEXTLINE(cppcoreguidelines-no-malloc,cppcoreguidelines-owning-memory)
       std::free(handle.item_buffer);
       break;
     case kSBPackbuffDeallocVM:
@@ -74,6 +75,9 @@ void releaseBuffer(const packbuff& handle) {
       break;
   }
 }
+
+// A growable buffer is heap memory that the handle owns and releases with
+// free(): a caller may also hand one over (dealloc type 1), so it is malloc'd.
 
 // Makes room for an item of `needed` bytes. A failed reallocation releases the
 // old buffer; the handle then starts again from nothing on its next growth.
@@ -89,8 +93,10 @@ int grow(packbuff* handle, std::size_t needed) {
       __builtin_add_overflow(allocated, rounded, &allocated)) {
     return ENOMEM;
   }
+  // NOLINTNEXTLINE(cppcoreguidelines-no-malloc,cppcoreguidelines-owning-memory)
   void* bigger = std::realloc(handle->item_buffer, allocated);
   if (bigger == nullptr) {
+    // NOLINTNEXTLINE(cppcoreguidelines-no-malloc,cppcoreguidelines-owning-memory)
     std::free(handle->item_buffer);
     handle->item_buffer = nullptr;
     handle->item = nullptr;
@@ -192,6 +198,7 @@ PackbuffRef sb_packbuff_new_with_tag(std::size_t blockSize) {
   PackbuffRef handle = newHandle();
   if (!handle) return nullptr;
   handle->block_size = blockSize < kHeader ? kSBPackbuffDefaultBlockSize : blockSize;
+  // NOLINTNEXTLINE(cppcoreguidelines-no-malloc,cppcoreguidelines-owning-memory)
   handle->item_buffer = static_cast<std::uint8_t*>(std::malloc(handle->block_size));
   if (handle->item_buffer == nullptr) return nullptr;
   handle->dealloc_type = kSBPackbuffDeallocFree;

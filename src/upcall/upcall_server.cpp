@@ -55,14 +55,13 @@ bool demux_server(const platform::UpcallMessage& request, std::vector<std::uint8
       KSTUpcallWord(message, kSize) != kKSTUpcallMessageSize) {
     code = kKSTUpcallBadArguments;
   } else if (message[kDescriptorType] != kKSTUpcallOutOfLineDescriptor ||
-             size != KSTUpcallWord(message, kRepeatedSize)) {
-    code = kKSTUpcallTypeError;
+             size != KSTUpcallWord(message, kRepeatedSize) ||
+             !(region = request.outOfLine(KSTUpcallWord(message, kAddress), size))) {
+    code = kKSTUpcallTypeError;  // not out-of-line memory, or no region of the message
   } else if (trailer.size() < 8 ||
              KSTUpcallWord(trailer, 0) != platform::kUpcallTrailerFormatDefault ||
              KSTUpcallWord(trailer, 4) < 32) {
     code = kKSTUpcallTrailerError;
-  } else if (!(region = request.outOfLine(KSTUpcallWord(message, kAddress), size))) {
-    code = kKSTUpcallTypeError;  // the descriptor names no region of the message
   }
   if (code != 0) {
     *reply = KSTUpcallErrorReply(message, code);

@@ -220,7 +220,10 @@ std::string renderUpcallReply(const DecodedUpcallReply& reply) {
   for (const auto& row : rows) width = std::max(width, row.first.size());
   std::string out;
   for (const auto& [what, value] : rows) {
-    out += what + std::string(width - what.size() + 2, ' ') + value + "\n";
+    out += what;
+    out.append(width - what.size() + 2, ' ');
+    out += value;
+    out += '\n';
   }
   return out;
 }

@@ -26,7 +26,7 @@ namespace {
 
 // Requests are a fixed part and a packed buffer of identifiers; a datagram
 // larger than this is no request of ours and closes its connection.
-constexpr std::size_t kMaxDatagramSize = 1024 * 1024;
+constexpr std::size_t kMaxDatagramSize = std::size_t{1024} * 1024;
 // How long a reply may wait for room in a peer that does not read its
 // replies. The main queue waits that long at most, then drops the peer.
 constexpr std::chrono::milliseconds kSendTimeout(250);

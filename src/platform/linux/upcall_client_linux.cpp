@@ -12,7 +12,7 @@ namespace kestrel::platform {
 namespace {
 
 // The largest reply read; replies are a fixed part and a few paths.
-constexpr std::size_t kMaxReplySize = 1024 * 1024;
+constexpr std::size_t kMaxReplySize = std::size_t{1024} * 1024;
 
 // 0, or the errno of the failure.
 int sendDatagram(int fd, std::span<const std::uint8_t> request) {
