@@ -131,7 +131,7 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
   const std::vector<Item> items = readAll(buffer.get());
 
   // Growable, in blocks drawn from the input: everything fits, and reads back.
-  PackbuffRef grown = sb_packbuff_new(size == 0 ? 0 : data[0]);
+  PackbuffRef grown = sb_packbuff_new(size == 0 ? 0 : std::size_t{data[0]} * 8);
   if (!grown) fail("no growable buffer");
   for (const Item& item : items) {
     if (const int error = pack(grown.get(), item)) fail("packing failed", std::to_string(error));
