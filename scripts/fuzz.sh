@@ -70,15 +70,16 @@ export UBSAN_OPTIONS="halt_on_error=1:print_stacktrace=1"
 
 # The largest input worth trying: the inputs drawn by FuzzedDataProvider reach
 # every shape well below 1 kB (the seeds are under 500 bytes), and longer ones
-# only make bigger messages of the same kinds; files and text keep libFuzzer's
-# 4 kB.
+# only make bigger messages of the same kinds; so do the upcall's packed
+# buffers and datagrams (a request is a few identifiers); files and text keep
+# libFuzzer's 4 kB.
 max_len_for() {
   if [[ -n "${KESTREL_FUZZ_MAX_LEN:-}" ]]; then
     echo "$KESTREL_FUZZ_MAX_LEN"
     return
   fi
   case "$1" in
-    fuzz_request_decoding | fuzz_dbus_message_codec | fuzz_upcall_demux) echo 1024 ;;
+    fuzz_request_decoding | fuzz_dbus_message_codec | fuzz_upcall_demux | fuzz_upcall_packbuff) echo 1024 ;;
     *) echo 4096 ;;
   esac
 }
