@@ -25,6 +25,8 @@ outputs=()
 for binary in "$build_dir"/bench/kestrel_*_bench; do
   [[ -x "$binary" ]] || continue
   name="$(basename "$binary")"
+  # These two talk to a running daemon: bench/request.sh and bench/upcall.sh run them.
+  case "$name" in kestrel_request_bench | kestrel_upcall_bench) continue ;; esac
   out="$results_dir/${name}-${stamp}.json"
   echo "== $name"
   "$binary" --benchmark_repetitions="$repetitions" --benchmark_report_aggregates_only=true \

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <sys/epoll.h>
+#include <sys/eventfd.h>
 #include <sys/signalfd.h>
 #include <unistd.h>
 
@@ -484,12 +485,212 @@ std::shared_ptr<QueueImpl> globalImpl(QueuePriority priority) {
 }
 
 // ---------------------------------------------------------------------------
-// The main queue: a serial queue drained by whoever runs the main loop.
+// Read sources. A handler never runs twice at once, and runs again only while
+// its descriptor is still ready after the previous run. The main loop waits
+// for the descriptors of the main queue's sources itself, between its items,
+// so that their handlers start on the main thread without a hand-over from
+// another thread (nor a re-arming call per run); one event thread waits for
+// all the others, each watched one-shot and armed again once its handler
+// returned.
+
+class EventSet;
+
+struct SourceState : std::enable_shared_from_this<SourceState> {
+  SourceState(UniqueFd descriptor, std::shared_ptr<DispatchQueue> target, Work work)
+      : fd(std::move(descriptor)), queue(std::move(target)), handler(std::move(work)) {}
+
+  // Our own duplicate of the watched descriptor: the watch never outlives it,
+  // and a descriptor number the caller closes and reuses cannot confuse us.
+  const UniqueFd fd;
+  const std::shared_ptr<DispatchQueue> queue;
+  EventSet* owner = nullptr;
+  int epoll = -1;
+  std::uint64_t id = 0;
+  // The main loop's sources stay armed: the loop runs their handlers itself,
+  // between its waits, so it never sees them ready while one runs. The event
+  // thread's are armed once per run of the handler.
+  bool levelTriggered = false;
+
+  std::mutex mutex;
+  std::condition_variable idle;
+  Work handler;
+  bool resumed = false;
+  bool cancelled = false;
+  bool running = false;
+  bool pending = false;  // a run is queued
+  std::thread::id runner;
+
+  // With mutex held.
+  void armLocked() {
+    epoll_event event{};
+    event.events = levelTriggered ? EPOLLIN : EPOLLIN | EPOLLONESHOT;
+    event.data.u64 = id;
+    if (epoll_ctl(epoll, EPOLL_CTL_MOD, fd.get(), &event) != 0) {
+      fail("cannot watch descriptor %d: %s", fd.get(), std::strerror(errno));
+    }
+  }
+
+  // On the thread that waited for the descriptor.
+  void onReady() {
+    {
+      std::lock_guard lock(mutex);
+      if (cancelled || !resumed || pending) return;
+      pending = levelTriggered;
+    }
+    queue->async([self = shared_from_this()] { self->fire(); });
+  }
+
+  // On the source's queue.
+  void fire() {
+    std::unique_lock lock(mutex);
+    if (cancelled) return;
+    running = true;
+    runner = std::this_thread::get_id();
+    lock.unlock();
+    runItem(queue->label(), handler);
+    lock.lock();
+    running = false;
+    pending = false;
+    Work finished;
+    if (cancelled) {
+      // The source went away while its handler ran (perhaps from inside it).
+      finished = std::move(handler);
+    } else if (!levelTriggered) {
+      armLocked();
+    }
+    idle.notify_all();
+    lock.unlock();
+  }
+};
+
+// An epoll set and the sources in it. Id 0 is never a source's: the main loop
+// keeps its wake-up descriptor under it.
+class EventSet {
+ public:
+  static constexpr std::uint64_t kWakeId = 0;
+
+  EventSet() : epoll_(epoll_create1(EPOLL_CLOEXEC)) {}
+
+  bool ok() const { return epoll_.valid(); }
+  int fd() const { return epoll_.get(); }
+
+  // Registers the source and adds its descriptor to the set, disarmed until resumed.
+  bool add(const std::shared_ptr<SourceState>& source) {
+    {
+      std::lock_guard lock(mutex_);
+      source->id = nextId_++;
+      source->owner = this;
+      source->epoll = epoll_.get();
+      sources_.emplace(source->id, source);
+    }
+    epoll_event event{};
+    event.events = EPOLLONESHOT;
+    event.data.u64 = source->id;
+    if (epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, source->fd.get(), &event) == 0) return true;
+    forget(source->id);
+    return false;
+  }
+
+  void forget(std::uint64_t id) {
+    std::lock_guard lock(mutex_);
+    sources_.erase(id);
+  }
+
+  // Waits for events (-1: for ever); the ready sources in `ready`, and
+  // whether the wake-up descriptor was among them.
+  bool wait(std::vector<std::shared_ptr<SourceState>>* ready, int timeoutMs) {
+    epoll_event events[32];
+    int count = epoll_wait(epoll_.get(), events, 32, timeoutMs);
+    if (count < 0) {
+      if (errno == EINTR) return false;
+      fail("waiting for descriptor events failed: %s", std::strerror(errno));
+    }
+    bool woken = false;
+    std::lock_guard lock(mutex_);
+    for (int i = 0; i < count; ++i) {
+      if (events[i].data.u64 == kWakeId) {
+        woken = true;
+        continue;
+      }
+      auto it = sources_.find(events[i].data.u64);
+      if (it != sources_.end()) ready->push_back(it->second);
+    }
+    return woken;
+  }
+
+ private:
+  UniqueFd epoll_;
+  std::mutex mutex_;
+  std::unordered_map<std::uint64_t, std::shared_ptr<SourceState>> sources_;
+  std::uint64_t nextId_ = 1;
+};
+
+class EventThread {
+ public:
+  EventThread() {
+    if (!events_.ok()) return;
+    try {
+      thread_ = dispatch_detail::startThread([this] { loop(); });
+    } catch (const std::system_error&) {
+      started_ = false;
+    }
+  }
+
+  bool ok() const { return events_.ok() && started_; }
+  EventSet& events() { return events_; }
+
+ private:
+  void loop() {
+    dispatch_detail::adoptWorkerThread("kst.events");
+    std::vector<std::shared_ptr<SourceState>> ready;
+    for (;;) {
+      events_.wait(&ready, -1);
+      for (const auto& source : ready) source->onReady();
+      ready.clear();
+    }
+  }
+
+  EventSet events_;
+  bool started_ = true;
+  std::thread thread_;
+};
+
+EventThread& eventThread() {
+  static Immortal<EventThread> events;
+  return events.get();
+}
+
+// ---------------------------------------------------------------------------
+// The main queue: a serial queue drained by whoever runs the main loop. While
+// it has nothing to run, the loop waits in its event set: for the main
+// queue's read sources, and for the wake-up descriptor that work submitted
+// from other threads (and stopMainLoop) write to.
 
 struct MainLoop {
+  MainLoop() : wake(eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK)) {
+    epoll_event event{};
+    event.events = EPOLLIN;
+    event.data.u64 = EventSet::kWakeId;
+    if (!events.ok() || !wake || epoll_ctl(events.fd(), EPOLL_CTL_ADD, wake.get(), &event) != 0) {
+      fail("cannot make the main loop's event set: %s", std::strerror(errno));
+    }
+  }
+
+  // With mutex held: gets a waiting loop out of its wait.
+  void wakeLocked() {
+    if (!sleeping) return;
+    sleeping = false;
+    const std::uint64_t one = 1;
+    if (::write(wake.get(), &one, sizeof one) < 0 && errno != EAGAIN) {
+      fail("cannot wake the main loop: %s", std::strerror(errno));
+    }
+  }
+
+  EventSet events;
+  UniqueFd wake;
   std::mutex mutex;
-  std::condition_variable wake;
   bool drainRequested = false;
+  bool sleeping = false;
   bool running = false;
   // Read between items without the mutex; written with it.
   std::atomic<bool> stopRequested{false};
@@ -514,7 +715,7 @@ class MainQueue : public SerialQueue {
     MainLoop& loop = mainLoop();
     std::lock_guard lock(loop.mutex);
     loop.drainRequested = true;
-    loop.wake.notify_all();
+    loop.wakeLocked();
   }
 
   bool shouldYield() const override { return mainLoop().stopRequested.load(); }
@@ -523,139 +724,6 @@ class MainQueue : public SerialQueue {
 std::shared_ptr<MainQueue> mainImpl() {
   static Immortal<std::shared_ptr<MainQueue>> queue(std::make_shared<MainQueue>());
   return queue.get();
-}
-
-// ---------------------------------------------------------------------------
-// Read sources. One thread waits on an epoll set for every source; a ready
-// descriptor is watched one-shot and armed again only once its handler
-// returned, so a handler never runs twice at once.
-
-struct SourceState : std::enable_shared_from_this<SourceState> {
-  SourceState(UniqueFd descriptor, std::shared_ptr<DispatchQueue> target, Work work)
-      : fd(std::move(descriptor)), queue(std::move(target)), handler(std::move(work)) {}
-
-  // Our own duplicate of the watched descriptor: the watch never outlives it,
-  // and a descriptor number the caller closes and reuses cannot confuse us.
-  const UniqueFd fd;
-  const std::shared_ptr<DispatchQueue> queue;
-  int epoll = -1;
-  std::uint64_t id = 0;
-
-  std::mutex mutex;
-  std::condition_variable idle;
-  Work handler;
-  bool resumed = false;
-  bool cancelled = false;
-  bool running = false;
-  std::thread::id runner;
-
-  // With mutex held.
-  void armLocked() {
-    epoll_event event{};
-    event.events = EPOLLIN | EPOLLONESHOT;
-    event.data.u64 = id;
-    if (epoll_ctl(epoll, EPOLL_CTL_MOD, fd.get(), &event) != 0) {
-      fail("cannot watch descriptor %d: %s", fd.get(), std::strerror(errno));
-    }
-  }
-
-  // On the event thread.
-  void onReady() {
-    {
-      std::lock_guard lock(mutex);
-      if (cancelled || !resumed) return;
-    }
-    queue->async([self = shared_from_this()] { self->fire(); });
-  }
-
-  // On the source's queue.
-  void fire() {
-    std::unique_lock lock(mutex);
-    if (cancelled) return;
-    running = true;
-    runner = std::this_thread::get_id();
-    lock.unlock();
-    runItem(queue->label(), handler);
-    lock.lock();
-    running = false;
-    Work finished;
-    if (cancelled) {
-      // The source went away while its handler ran (perhaps from inside it).
-      finished = std::move(handler);
-    } else {
-      armLocked();
-    }
-    idle.notify_all();
-    lock.unlock();
-  }
-};
-
-class EventThread {
- public:
-  EventThread() : epoll_(epoll_create1(EPOLL_CLOEXEC)) {
-    if (!epoll_) return;
-    try {
-      thread_ = dispatch_detail::startThread([this] { loop(); });
-    } catch (const std::system_error&) {
-      epoll_.reset();
-    }
-  }
-
-  bool ok() const { return epoll_.valid(); }
-
-  // Registers the source and adds its descriptor to the set, disarmed until resumed.
-  bool add(const std::shared_ptr<SourceState>& source) {
-    {
-      std::lock_guard lock(mutex_);
-      source->id = nextId_++;
-      source->epoll = epoll_.get();
-      sources_.emplace(source->id, source);
-    }
-    epoll_event event{};
-    event.events = EPOLLONESHOT;
-    event.data.u64 = source->id;
-    if (epoll_ctl(epoll_.get(), EPOLL_CTL_ADD, source->fd.get(), &event) == 0) return true;
-    forget(source->id);
-    return false;
-  }
-
-  void forget(std::uint64_t id) {
-    std::lock_guard lock(mutex_);
-    sources_.erase(id);
-  }
-
- private:
-  void loop() {
-    dispatch_detail::adoptWorkerThread("kst.events");
-    epoll_event events[32];
-    for (;;) {
-      int count = epoll_wait(epoll_.get(), events, 32, -1);
-      if (count < 0) {
-        if (errno == EINTR) continue;
-        fail("waiting for descriptor events failed: %s", std::strerror(errno));
-      }
-      for (int i = 0; i < count; ++i) {
-        std::shared_ptr<SourceState> source;
-        {
-          std::lock_guard lock(mutex_);
-          auto it = sources_.find(events[i].data.u64);
-          if (it != sources_.end()) source = it->second;
-        }
-        if (source) source->onReady();
-      }
-    }
-  }
-
-  UniqueFd epoll_;
-  std::mutex mutex_;
-  std::unordered_map<std::uint64_t, std::shared_ptr<SourceState>> sources_;
-  std::uint64_t nextId_ = 1;
-  std::thread thread_;
-};
-
-EventThread& eventThread() {
-  static Immortal<EventThread> events;
-  return events.get();
 }
 
 class ReadSourceImpl : public ReadSource {
@@ -674,7 +742,7 @@ class ReadSourceImpl : public ReadSource {
       }
       if (!state_->running) handler = std::move(state_->handler);
     }
-    eventThread().forget(state_->id);
+    state_->owner->forget(state_->id);
   }
 
   ReadSourceImpl(const ReadSourceImpl&) = delete;
@@ -715,15 +783,31 @@ int runMainLoop() {
   std::unique_lock lock(loop.mutex);
   if (loop.running) fail("runMainLoop() is already running");
   loop.running = true;
+  std::vector<std::shared_ptr<SourceState>> ready;
   while (!loop.stopRequested.load()) {
+    // With items to run, only a look at the sources: a busy queue does not
+    // keep their handlers waiting for ever.
+    const bool idle = !loop.drainRequested;
+    loop.sleeping = idle;
+    lock.unlock();
+    const bool woken = loop.events.wait(&ready, idle ? -1 : 0);
+    lock.lock();
+    loop.sleeping = false;
+    lock.unlock();
+    if (woken) {
+      std::uint64_t count = 0;
+      (void)::read(loop.wake.get(), &count, sizeof count);
+    }
+    // Each handler becomes an item of the main queue, drained right here.
+    for (const auto& source : ready) source->onReady();
+    ready.clear();
+    lock.lock();
     if (loop.drainRequested) {
       loop.drainRequested = false;
       lock.unlock();
       queue->drain();
       lock.lock();
-      continue;
     }
-    loop.wake.wait(lock);
   }
   loop.stopRequested.store(false);
   loop.running = false;
@@ -735,19 +819,27 @@ void stopMainLoop(int status) {
   std::lock_guard lock(loop.mutex);
   loop.status = status;
   loop.stopRequested.store(true);
-  loop.wake.notify_all();
+  loop.wakeLocked();
 }
 
 std::unique_ptr<ReadSource> ReadSource::create(int fd, std::shared_ptr<DispatchQueue> queue,
                                                Work handler) {
   if (!queue) fail("ReadSource::create() needs a queue");
-  EventThread& events = eventThread();
-  if (!events.ok()) return nullptr;
+  EventSet* events = nullptr;
+  const bool main = queue == std::static_pointer_cast<DispatchQueue>(mainImpl());
+  if (main) {
+    events = &mainLoop().events;
+  } else if (eventThread().ok()) {
+    events = &eventThread().events();
+  } else {
+    return nullptr;
+  }
   UniqueFd duplicate(fcntl(fd, F_DUPFD_CLOEXEC, 0));
   if (!duplicate) return nullptr;
   auto state =
       std::make_shared<SourceState>(std::move(duplicate), std::move(queue), std::move(handler));
-  if (!events.add(state)) return nullptr;
+  state->levelTriggered = main;
+  if (!events->add(state)) return nullptr;
   return std::make_unique<ReadSourceImpl>(std::move(state));
 }
 

@@ -1,6 +1,8 @@
-// The kernel upcall server: receives the sandbox's requests on the main queue
-// and answers each with one reply message.
+// The kernel upcall server: receives the sandbox's messages on the main queue,
+// one at a time, and answers each with one reply message.
 #pragma once
+
+#include <sys/types.h>
 
 #include <cstdint>
 #include <optional>
@@ -11,15 +13,24 @@
 
 namespace kestrel {
 
-inline constexpr std::uint32_t kKSTUpcallGetProcessContainersId = 322514900;
-inline constexpr std::int32_t kKSTUpcallBadId = -303;
+// The receive handler: the reply to one message, or nothing when the message
+// is not this server's.
+std::optional<std::vector<std::uint8_t>> KSTUpcallReceive(const platform::UpcallMessage& request);
 
-// The reply to one request datagram; nothing for a datagram too short to carry a header.
-std::optional<std::vector<std::uint8_t>> KSTUpcallReceive(std::span<const std::uint8_t> request,
-                                                          const platform::UpcallPeer& peer);
+// The server's routine table: checks the message and runs its routine. False
+// (reply untouched) when the message is not this server's.
+bool demux_server(const platform::UpcallMessage& request, std::vector<std::uint8_t>* reply);
 
-// A 36-byte error reply to the request whose header is given.
-std::vector<std::uint8_t> KSTUpcallErrorReply(std::span<const std::uint8_t> requestHeader,
-                                              std::int32_t returnCode);
+// The region of a successful reply.
+struct KSTUpcallOutOfLine {
+  std::vector<std::uint8_t> bytes;
+  bool deallocate = false;  // set when the copy was made
+};
+
+// The sandbox's question, which containers the process has: 0 with the
+// packed reply in `reply`, 4 for an unknown item, 5 for a request that cannot
+// be read or a sender other than the kernel (pid 0), 9 without memory.
+std::int32_t server_get_process_containers(pid_t senderPid, std::span<const std::uint8_t> request,
+                                           KSTUpcallOutOfLine* reply);
 
 }  // namespace kestrel

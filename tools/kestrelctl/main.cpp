@@ -13,6 +13,8 @@
 // request was refused); 5 for a D-Bus error reply; 6 for a failure of the
 // tool itself.
 #include <CLI/CLI.hpp>
+#include <algorithm>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
@@ -29,11 +31,13 @@
 #include "human_output.h"
 #include "platform/linux/dbus_listener.h"
 #include "platform/linux/named_semaphores_linux.h"
+#include "platform/linux/upcall_client_linux.h"
 #include "platform/plist_serialization.h"
 #include "platform/root.h"
 #include "platform/services.h"
 #include "reply_json.h"
 #include "request_items.h"
+#include "upcall_command.h"
 
 namespace {
 
@@ -201,6 +205,56 @@ int runPlist(const std::string& file) {
   return kExitSuccess;
 }
 
+// The sandbox's question over the upcall socket (only root, or a process
+// allowed to override file permissions, can connect to it).
+int runUpcall(const std::string& socketPath, const kestrelctl::UpcallRequestOptions& options,
+              bool json, std::uint64_t timeoutSeconds) {
+  std::vector<std::uint8_t> request;
+  std::string error;
+  if (!kestrelctl::buildUpcallRequest(options, &request, &error)) {
+    std::cerr << "kestrelctl: upcall: " << error << "\n";
+    return kExitUsage;
+  }
+  std::optional<platform::UpcallClient> client =
+      platform::UpcallClient::connect(socketPath, &error);
+  if (!client) {
+    std::cerr << "kestrelctl: cannot reach the upcall socket " << error << "\n";
+    return kExitUnreachable;
+  }
+  const platform::UpcallClient::Outcome outcome =
+      client->call(request, std::chrono::seconds(timeoutSeconds));
+  switch (outcome.status) {
+    case platform::UpcallClient::Status::Reply:
+      break;
+    case platform::UpcallClient::Status::Closed:
+      std::cerr << "kestrelctl: " << outcome.message << "\n";
+      return kExitRefused;
+    case platform::UpcallClient::Status::TimedOut:
+      std::cerr << "kestrelctl: " << outcome.message << "\n";
+      return kExitUnreachable;
+    case platform::UpcallClient::Status::Failed:
+      std::cerr << "kestrelctl: " << outcome.message << "\n";
+      return kExitInternal;
+  }
+  const std::optional<kestrelctl::DecodedUpcallReply> reply =
+      kestrelctl::decodeUpcallReply(outcome.reply, &error);
+  if (!reply) {
+    std::cerr << "kestrelctl: a malformed reply: " << error << "\n";
+    return kExitInternal;
+  }
+  if (json) std::cout << kestrelctl::upcallReplyToJson(*reply).dump(2) << "\n";
+  if (reply->returnCode != 0) {
+    std::cerr << "kestrelctl: upcall failed: return code " << reply->returnCode << " ("
+              << kestrelctl::upcallReturnCodeText(reply->returnCode) << ")\n";
+    return kExitReplyError;
+  }
+  if (!json) std::cout << kestrelctl::renderUpcallReply(*reply);
+  const auto status = std::find_if(reply->items.begin(), reply->items.end(), [](const auto& item) {
+    return item.valueType == 0 && item.number;
+  });
+  return status != reply->items.end() && *status->number == 1 ? kExitSuccess : kExitReplyError;
+}
+
 // Removes the mark that the boot-time work was done for this root, so that
 // the daemon's next start does it again. Beneath a root other than /, the
 // mark is a named semaphore in /dev/shm that outlives the root: removing a
@@ -287,6 +341,7 @@ int run(int argc, char** argv) {
       "Data/VantlerPlugin, Bundle/VPNPlugin, Data/VPNPlugin, Shared/AppGroup, Bundle/Framework,\n"
       "Data/VexelService, Data/InternalDaemon, Data/TempDir, Data/System, Shared/SystemGroup.\n"
       "call item types: u64, i64, bool, str, uuid, data (hex), plist (a JSON value).\n"
+      "upcall exits 0 only for return code 0 with status 1.\n"
       "Examples: kestrelctl create --class Data/Application --user 501 "
       "--identifier com.example.app\n"
       "          kestrelctl call 0 ContainerClass=u64:2 UserID=u64:501 "
@@ -332,6 +387,29 @@ int run(int argc, char** argv) {
       "Forget that the boot-time work was done for the root (the daemon's next start redoes it)");
   resetFirstBoot->fallthrough();
 
+  kestrelctl::UpcallRequestOptions upcallOptions;
+  std::string upcallSocket;
+  CLI::App* upcall = app.add_subcommand(
+      "upcall", "Ask which containers a process gets, as the sandbox does at its start");
+  upcall->add_option("--signing-identifier", upcallOptions.signingIdentifier,
+                     "The process's code-signing identifier");
+  upcall->add_option("--container-identifier", upcallOptions.containerIdentifier,
+                     "Its container identifier, when it differs");
+  upcall->add_option("--application-identifier", upcallOptions.applicationIdentifier,
+                     "Its application identifier (sent, not used)");
+  upcall->add_option("--persona", upcallOptions.persona, "The user whose containers are meant");
+  upcall->add_option("--group", upcallOptions.groups, "An app group (repeatable)");
+  upcall->add_option("--system-container", upcallOptions.systemContainer,
+                     "A system container identifier");
+  upcall->add_option("--system-group", upcallOptions.systemGroups,
+                     "A system group container identifier (repeatable)");
+  upcall->add_flag("--plugin", upcallOptions.plugin, "The process is a plug-in");
+  upcall->add_option("--item", upcallOptions.items,
+                     "A further request item: <value type>=u32:<n> or <value type>=str:<text>");
+  upcall->add_option("--socket", upcallSocket,
+                     "The upcall socket (default: <root>/run/kestrel/com.zorvane.kestreld.upcall)");
+  upcall->fallthrough();
+
   // Sized up front: the options keep pointers into their entries.
   std::vector<NamedArguments> named(kestrelctl::subcommands().size());
   for (std::size_t i = 0; i < named.size(); ++i) {
@@ -355,6 +433,12 @@ int run(int argc, char** argv) {
     address = "unix:path=" + platform::messageServiceSocketPath(filesystemRoot, kKSTServiceName);
   }
   if (resetFirstBoot->parsed()) return runResetFirstBoot(filesystemRoot);
+  if (upcall->parsed()) {
+    if (upcallSocket.empty()) {
+      upcallSocket = platform::upcallSocketPath(filesystemRoot, kKSTUpcallServiceName);
+    }
+    return runUpcall(upcallSocket, upcallOptions, json, timeoutSeconds);
+  }
   if (fsck->parsed()) return runFsck(filesystemRoot, address, offline, timeoutSeconds);
   for (std::size_t i = 0; i < named.size(); ++i) {
     if (named[i].app->parsed()) {

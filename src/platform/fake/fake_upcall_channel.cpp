@@ -38,9 +38,10 @@ std::shared_ptr<UpcallPort> FakeUpcallChannel::checkIn(const std::string& servic
 
 std::unique_ptr<ReadSource> FakeUpcallChannel::createReceiveSource(
     std::shared_ptr<UpcallPort> /*port*/, std::shared_ptr<DispatchQueue> /*queue*/,
-    UpcallHandler handler) {
+    std::size_t maxMessageSize, UpcallHandler handler, UpcallProblemHandler /*problems*/) {
   std::lock_guard lock(mutex_);
   if (sourceFails_) return nullptr;
+  maxMessageSize_ = maxMessageSize;
   handler_ = std::move(handler);
   return std::make_unique<FakeUpcallSource>(*this);
 }
@@ -66,14 +67,17 @@ bool FakeUpcallChannel::sourceResumed() const {
 }
 
 std::optional<std::vector<std::uint8_t>> FakeUpcallChannel::deliver(
-    const std::vector<std::uint8_t>& request, const UpcallPeer& peer) {
+    std::vector<std::uint8_t> datagram, const UpcallPeer& peer) {
   UpcallHandler handler;
+  std::optional<UpcallMessage> message;
   {
     std::lock_guard lock(mutex_);
     handler = handler_;
+    message = UpcallMessage::fromDatagram(std::move(datagram), peer, maxMessageSize_, ++sequence_,
+                                          nullptr);
   }
-  if (!handler) return std::nullopt;
-  return handler(request, peer);
+  if (!handler || !message) return std::nullopt;
+  return handler(*message);
 }
 
 }  // namespace kestrel::platform

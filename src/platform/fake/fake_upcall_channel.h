@@ -17,14 +17,16 @@ class FakeUpcallChannel final : public UpcallChannel {
                                       std::string* errorText) override;
   std::unique_ptr<ReadSource> createReceiveSource(std::shared_ptr<UpcallPort> port,
                                                   std::shared_ptr<DispatchQueue> queue,
-                                                  UpcallHandler handler) override;
+                                                  std::size_t maxMessageSize, UpcallHandler handler,
+                                                  UpcallProblemHandler problems) override;
 
   void setCheckInFails(bool fails);
   void setSourceFails(bool fails);
   std::vector<std::string> checkedIn() const;
   bool sourceResumed() const;
-  // Calls the receive source's handler, as a request from the peer would.
-  std::optional<std::vector<std::uint8_t>> deliver(const std::vector<std::uint8_t>& request,
+  // Calls the receive source's handler, as a request datagram from the peer
+  // would; nothing when the datagram carries no message or is not answered.
+  std::optional<std::vector<std::uint8_t>> deliver(std::vector<std::uint8_t> datagram,
                                                    const UpcallPeer& peer);
 
  private:
@@ -34,6 +36,8 @@ class FakeUpcallChannel final : public UpcallChannel {
   bool sourceFails_ = false;
   bool sourceResumed_ = false;
   std::vector<std::string> checkedIn_;
+  std::size_t maxMessageSize_ = 0;
+  std::uint32_t sequence_ = 0;
   UpcallHandler handler_;
 };
 
