@@ -27,6 +27,11 @@ void KSTHandleWipeContainer(KSTCommandContext& context);
 // 4: the death-row sweep; replies from its completion.
 void KSTHandleDeleteDeathRow(KSTCommandContext& context);
 
+// 5 and 6: set and get one info value of a container; 7: its metadata record.
+void KSTHandleSetInfoValue(KSTCommandContext& context);
+void KSTHandleGetInfoValue(KSTCommandContext& context);
+void KSTHandleGetMetadata(KSTCommandContext& context);
+
 // 13: the app-group container paths of an identifier; 14: its app-group ids.
 void KSTHandleAppGroupContainerPaths(KSTCommandContext& context);
 void KSTHandleAppGroupIdentifiers(KSTCommandContext& context);

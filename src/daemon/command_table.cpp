@@ -13,14 +13,14 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {2, KSTHandleReplaceContainer, kKSTEntitlementAllowed, 1},  // replace a container by another
       {3, KSTHandleStageForDelete, kKSTEntitlementAllowed, 1},    // stage containers for deletion
       {4, KSTHandleDeleteDeathRow, kKSTEntitlementAllowed, 0},    // destroy what is on death row
-      {5, nullptr, kKSTEntitlementAllowed, 1},                    // set an info value
-      {6, nullptr, kKSTEntitlementAllowed, 1},                    // get an info value
-      {7, nullptr, kKSTEntitlementAllowed, 1},                    // get a container's metadata
+      {5, KSTHandleSetInfoValue, kKSTEntitlementAllowed, 1},      // set an info value
+      {6, KSTHandleGetInfoValue, kKSTEntitlementAllowed, 1},      // get an info value
+      {7, KSTHandleGetMetadata, kKSTEntitlementAllowed, 1},       // get a container's metadata
       {8, nullptr, kKSTEntitlementAllowed, 1},                    // recreate the default structure
       {9, nullptr, kKSTEntitlementAllowed, 1},                    // give a container a new UUID
       {10, KSTHandleDeleteContainer, kKSTEntitlementAllowed, 1},  // delete a container
       {11, KSTHandleWipePluginContainer, kKSTEntitlementWipeContainer,
-       1},                                              // wipe a plug-in data container
+       1},                                                      // wipe a plug-in data container
       {12, KSTHandleWipeContainer, kKSTEntitlementAllowed, 1},  // delete a data container's content
       {13, KSTHandleAppGroupContainerPaths, kKSTEntitlementNone,
        1},  // the client's app-group paths
