@@ -126,6 +126,18 @@ TEST_F(RequestDispatchTest, AdmittedClientCarriesItsIdentityAndRights) {
       fakes.logging->containsMessage("Failed to copy signing ID for pid 4242 : not signed"));
 }
 
+// While its application is held terminated, a client is not served at all.
+TEST_F(RequestDispatchTest, ClientsHeldTerminatedAreRefused) {
+  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
+  auto held = fakes.applicationLifecycle->acquireTerminationAssertion(
+      "com.example.client", platform::TerminationReason::Installation, [](const auto&) {});
+  EXPECT_EQ(admit(0), nullptr);
+  EXPECT_TRUE(fakes.logged(
+      "connection attempt from pid 4242 (com.example.client) refused: it is held terminated"));
+  held->invalidate();
+  EXPECT_NE(admit(0), nullptr);
+}
+
 // Index 27 and a refusal are checked end to end.
 TEST_F(RequestDispatchTest, RequestsThatCannotBeServedCloseTheConnectionWithoutReply) {
   struct Row {
