@@ -51,6 +51,10 @@ void KSTHandleGetCodeSigningInfo(KSTCommandContext& context);
 // 20: invalidates the code-signing information of apps without a bundle container.
 void KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer(KSTCommandContext& context);
 
+// 21: moves a data container's files to another protection class; replies
+// from the change's completion.
+void KSTHandleSetDataProtection(KSTCommandContext& context);
+
 // 25: the retry test, on internal builds only.
 void KSTHandleRetryTest(KSTCommandContext& context);
 

@@ -35,8 +35,8 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
        1},  // process code-signing information
       {19, KSTHandleGetCodeSigningInfo, kKSTEntitlementAllowed, 1},  // get code-signing information
       {20, KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kKSTEntitlementAllowed,
-       1},                                                  // invalidate apps without bundles
-      {21, nullptr, kKSTEntitlementAllowed, 0},             // set a data container's protection
+       1},  // invalidate apps without bundles
+      {21, KSTHandleSetDataProtection, kKSTEntitlementAllowed, 0},  // set a container's protection
       {22, nullptr, kKSTEntitlementAllowed, 1},             // recreate the default structure
       {23, nullptr, kKSTEntitlementAllowed, 1},             // measure disk usage
       {24, nullptr, kKSTEntitlementDataMigration, 1},       // the data-migration migration
