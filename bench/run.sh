@@ -43,6 +43,7 @@ PAIRS = [
     ("BM_IdentifierLockReading", "BM_SharedMutexReading"),
     ("BM_CacheLookup", "BM_PlainLstat"),
     ("BM_CacheRebuild", "BM_PlainReadMetadataFiles"),
+    ("BM_ProtectionChange", "BM_BareXattrWalk"),
 ]
 TO_NS = {"ns": 1.0, "us": 1e3, "ms": 1e6, "s": 1e9}
 

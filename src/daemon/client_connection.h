@@ -133,6 +133,31 @@ class KSTClientConnection {
       const std::optional<std::string>& sourceRelativePath,
       const std::optional<std::string>& destRelativePath, std::uint64_t* withError);
 
+  // Info values and the metadata record (operations/info_values.cpp). The
+  // container is the cached one of the user, class, identifier and internal
+  // UUID; the identifier lock of that UUID's text is held for writing by set
+  // (across the change, the metadata file's write and the cache update) and
+  // for reading by the queries. The info operations lock only with
+  // useLocking; the metadata query always does. An absent value removes the
+  // key. Codes: 11 (no UUID, or a class outside 1..13), 38 (no key), 21 (no
+  // such container), 24 (no such key; not logged), 45, and the metadata
+  // writer's own.
+  void setInfoValue(const std::optional<PlistValue>& value,
+                    const std::optional<std::string>& forKey, std::uint32_t userId,
+                    const std::optional<platform::Uuid>& uuid,
+                    const std::optional<std::string>& identifier, KSTContainerClass containerClass,
+                    bool useLocking, std::uint64_t* withError);
+  std::optional<PlistValue> infoValueForKey(const std::optional<std::string>& key,
+                                            std::uint32_t userId,
+                                            const std::optional<platform::Uuid>& uuid,
+                                            const std::optional<std::string>& identifier,
+                                            KSTContainerClass containerClass, bool useLocking,
+                                            std::uint64_t* withError);
+  KSTMetadataRef metadataForUser(std::uint32_t userId,
+                                 const std::optional<platform::Uuid>& withUUID,
+                                 const std::optional<std::string>& identifier,
+                                 KSTContainerClass containerClass, std::uint64_t* withError);
+
   // Start-up and boot housekeeping of the container store.
   void rebootContainerManagerSetup();
   void containerManagerSetup();

@@ -27,6 +27,11 @@ void KSTHandleWipeContainer(KSTCommandContext& context);
 // 4: the death-row sweep; replies from its completion.
 void KSTHandleDeleteDeathRow(KSTCommandContext& context);
 
+// 5 and 6: set and get one info value of a container; 7: its metadata record.
+void KSTHandleSetInfoValue(KSTCommandContext& context);
+void KSTHandleGetInfoValue(KSTCommandContext& context);
+void KSTHandleGetMetadata(KSTCommandContext& context);
+
 // 13: the app-group container paths of an identifier; 14: its app-group ids.
 void KSTHandleAppGroupContainerPaths(KSTCommandContext& context);
 void KSTHandleAppGroupIdentifiers(KSTCommandContext& context);
@@ -45,6 +50,10 @@ void KSTHandleProcessCodeSigningInfo(KSTCommandContext& context);
 void KSTHandleGetCodeSigningInfo(KSTCommandContext& context);
 // 20: invalidates the code-signing information of apps without a bundle container.
 void KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer(KSTCommandContext& context);
+
+// 21: moves a data container's files to another protection class; replies
+// from the change's completion.
+void KSTHandleSetDataProtection(KSTCommandContext& context);
 
 // 26: stages shared content inside a system group container.
 void KSTHandleStageSharedContent(KSTCommandContext& context);

@@ -13,9 +13,9 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {2, KSTHandleReplaceContainer, kKSTEntitlementAllowed, 1},  // replace a container by another
       {3, KSTHandleStageForDelete, kKSTEntitlementAllowed, 1},    // stage containers for deletion
       {4, KSTHandleDeleteDeathRow, kKSTEntitlementAllowed, 0},    // destroy what is on death row
-      {5, nullptr, kKSTEntitlementAllowed, 1},                    // set an info value
-      {6, nullptr, kKSTEntitlementAllowed, 1},                    // get an info value
-      {7, nullptr, kKSTEntitlementAllowed, 1},                    // get a container's metadata
+      {5, KSTHandleSetInfoValue, kKSTEntitlementAllowed, 1},      // set an info value
+      {6, KSTHandleGetInfoValue, kKSTEntitlementAllowed, 1},      // get an info value
+      {7, KSTHandleGetMetadata, kKSTEntitlementAllowed, 1},       // get a container's metadata
       {8, nullptr, kKSTEntitlementAllowed, 1},                    // recreate the default structure
       {9, nullptr, kKSTEntitlementAllowed, 1},                    // give a container a new UUID
       {10, KSTHandleDeleteContainer, kKSTEntitlementAllowed, 1},  // delete a container
@@ -35,8 +35,8 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
        1},  // process code-signing information
       {19, KSTHandleGetCodeSigningInfo, kKSTEntitlementAllowed, 1},  // get code-signing information
       {20, KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kKSTEntitlementAllowed,
-       1},                                                  // invalidate apps without bundles
-      {21, nullptr, kKSTEntitlementAllowed, 0},             // set a data container's protection
+       1},  // invalidate apps without bundles
+      {21, KSTHandleSetDataProtection, kKSTEntitlementAllowed, 0},  // set a container's protection
       {22, nullptr, kKSTEntitlementAllowed, 1},             // recreate the default structure
       {23, nullptr, kKSTEntitlementAllowed, 1},             // measure disk usage
       {24, nullptr, kKSTEntitlementDataMigration, 1},       // the data-migration migration

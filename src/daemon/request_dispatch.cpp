@@ -56,6 +56,13 @@ std::unique_ptr<KSTClientConnection> checkEntitlementsAndInitClientObject(
   if (!bundleId) {
     KSTLog(kLogError, "Failed to copy signing ID for pid %d : %@", pid, identity.error);
   }
+  // An application held terminated is not served, whatever it is entitled to.
+  const auto& lifecycle = platform::services().applicationLifecycle;
+  if (bundleId && lifecycle && lifecycle->isHeldTerminated(*bundleId)) {
+    KSTLog(kLogNotice, "connection attempt from pid %d (%@) refused: it is held terminated", pid,
+           bundleId);
+    return nullptr;
+  }
 
   // 2-3. An empty dictionary grants nothing: such a peer has no entitlements at all.
   bool admitted = entitlementIsNone;

@@ -32,4 +32,9 @@ struct PeerCredentials {
 // Reads the credentials of the peer of a connected Unix socket.
 PeerCredentials readPeerCredentials(int socketFd);
 
+// The same for a running process, found by its pid (its label is the one in
+// /proc/<pid>/attr/current). Without a pidfd when the process is gone; uid
+// and gid are -1 when they could not be read.
+PeerCredentials readProcessCredentials(pid_t pid);
+
 }  // namespace kestrel::platform

@@ -5,6 +5,7 @@
 #include <memory>
 
 #include "platform/accounts.h"
+#include "platform/application_lifecycle.h"
 #include "platform/code_signing_identity.h"
 #include "platform/device_info.h"
 #include "platform/extended_acl.h"
@@ -32,6 +33,7 @@ struct Services {
   std::shared_ptr<Sandbox> sandbox;
   std::shared_ptr<CodeSigningIdentity> codeSigningIdentity;
   std::shared_ptr<ExtendedACL> extendedACL;
+  std::shared_ptr<ApplicationLifecycle> applicationLifecycle;
 };
 
 // The installed services. Installing is done before any other thread uses them.

@@ -5,7 +5,7 @@
 // or tested: removal of a missing item succeeds, and it counts as absent.
 // Symbolic links are never followed by traversal, listing, copy or removal.
 //
-// Its access-control-list, protection-class query and disk-usage operations
+// Its access-control-list, protection-class item and disk-usage operations
 // live with the subsystems that use them.
 #pragma once
 
@@ -31,6 +31,9 @@ enum class KSTProtectionClass : std::int32_t {};
 // Class 4: the files stay readable while the device is locked. The daemon's
 // own files are written in it ("data-protection class none").
 inline constexpr KSTProtectionClass kKSTProtectionClassNone{4};
+// Class 3: what an item that carries no class counts as, as a container
+// that records no class does (items made by applications carry none).
+inline constexpr KSTProtectionClass kKSTProtectionClassUnrecorded{3};
 // All bits set (4294967295, -1): leave the class as it is.
 inline constexpr KSTProtectionClass kKSTProtectionClassLeaveAlone{-1};
 // Owner 0: leave the owner as it is.
@@ -169,6 +172,21 @@ class KSTFileManager {
                               const std::string& displayPath, KSTErrorRef* error) const;
   // The above for every item of a class directory; a missing directory is success.
   bool standardizeAllSystemContainerACLsAtURL(const KSTFileURL& url, KSTErrorRef* error) const;
+
+  // --- Protection classes of single items (protection/protection_class_items.cpp) ---
+  // The item is opened without following a symbolic link; failures are
+  // POSIX-domain errors with errno as their code ("Failed to open %s : %s",
+  // "Failed to getclass of file %s: %s", "Failed to setclass(%d) on file
+  // %s: %s"), not logged. An item without a class reads as
+  // kKSTProtectionClassUnrecorded.
+
+  bool dataProtectionClassOfItemAtURL(const KSTFileURL& url, KSTProtectionClass* protectionClass,
+                                      KSTErrorRef* error) const;
+  // With a predicate, the item's class is read first and, when the predicate
+  // refuses it, the item is left as it is (success).
+  bool setDataProtectionClassOfItemAtURL(
+      const KSTFileURL& url, KSTProtectionClass toClass,
+      const std::function<bool(KSTProtectionClass current)>& ifPredicate, KSTErrorRef* error) const;
 
  private:
   KSTFileManager() = default;

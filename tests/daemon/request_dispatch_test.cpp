@@ -126,6 +126,18 @@ TEST_F(RequestDispatchTest, AdmittedClientCarriesItsIdentityAndRights) {
       fakes.logging->containsMessage("Failed to copy signing ID for pid 4242 : not signed"));
 }
 
+// While its application is held terminated, a client is not served at all.
+TEST_F(RequestDispatchTest, ClientsHeldTerminatedAreRefused) {
+  connect(501, PlistDictionary{{kKSTEntitlementAllowed, true}});
+  auto held = fakes.applicationLifecycle->acquireTerminationAssertion(
+      "com.example.client", platform::TerminationReason::Installation, [](const auto&) {});
+  EXPECT_EQ(admit(0), nullptr);
+  EXPECT_TRUE(fakes.logged(
+      "connection attempt from pid 4242 (com.example.client) refused: it is held terminated"));
+  held->invalidate();
+  EXPECT_NE(admit(0), nullptr);
+}
+
 // Index 27 and a refusal are checked end to end.
 TEST_F(RequestDispatchTest, RequestsThatCannotBeServedCloseTheConnectionWithoutReply) {
   struct Row {
@@ -138,7 +150,8 @@ TEST_F(RequestDispatchTest, RequestsThatCannotBeServedCloseTheConnectionWithoutR
       // The index is logged as a signed number.
       {"huge command index", std::uint64_t{1} << 63, true, false,
        "Invalid command index: -9223372036854775808"},
-      {"info value, not served by this build yet", 5, true, false, "Command 5 is not available"},
+      {"structure repair, not served by this build yet", 8, true, false,
+       "Command 8 is not available"},
       {"no reply context", 25, false, false, "Dictionary does not have reply context"},
       // The customer build's answer is checked end to end.
       {"retry test on an internal build", 25, true, true, nullptr},

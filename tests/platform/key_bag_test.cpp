@@ -1,5 +1,7 @@
 #include <gtest/gtest.h>
 
+#include <filesystem>
+
 #include <algorithm>
 #include <chrono>
 #include <condition_variable>
@@ -20,6 +22,7 @@ using testing::ScratchRoot;
 constexpr const char* kLockState = "/run/kestrel/lock-state";
 constexpr const char* kMultiUser = "/etc/kestrel/multi-user";
 
+// One key bag throughout: each write (and the removal) is seen at once.
 TEST(KeyBagTest, LockStateIsParsedFromTheLockStateFile) {
   struct Row {
     const char* content;  // nullptr: no file
@@ -32,12 +35,18 @@ TEST(KeyBagTest, LockStateIsParsedFromTheLockStateFile) {
       {"3\n", 3},
       {"", -1},
       {"1x", -1},
+      {nullptr, KeyBag::kUnlocked},
   };
+  ScratchRoot scratch;
+  LinuxKeyBag keyBag(scratch.root());
   for (const Row& row : rows) {
     SCOPED_TRACE(row.content != nullptr ? "\"" + std::string(row.content) + "\"" : "no file");
-    ScratchRoot scratch;
-    if (row.content != nullptr) scratch.writeFile(kLockState, row.content);
-    EXPECT_EQ(LinuxKeyBag(scratch.root()).lockState(), row.expected);
+    if (row.content != nullptr) {
+      scratch.writeFile(kLockState, row.content);
+    } else {
+      std::filesystem::remove(scratch.resolve(kLockState));
+    }
+    EXPECT_EQ(keyBag.lockState(), row.expected);
   }
 }
 

@@ -16,9 +16,21 @@ FakeServices::FakeServices()
       messageIPC(std::make_shared<platform::FakeMessageIPC>()),
       sandbox(std::make_shared<platform::FakeSandbox>()),
       codeSigningIdentity(std::make_shared<platform::FakeCodeSigningIdentity>()),
-      extendedACL(std::make_shared<platform::FakeExtendedACL>(accounts)) {
-  services = {scratch.root(), accounts, logging,    deviceInfo, keepAlive,           semaphores,
-              keyBag,         upcall,   messageIPC, sandbox,    codeSigningIdentity, extendedACL};
+      extendedACL(std::make_shared<platform::FakeExtendedACL>(accounts)),
+      applicationLifecycle(std::make_shared<platform::FakeApplicationLifecycle>()) {
+  services = {scratch.root(),
+              accounts,
+              logging,
+              deviceInfo,
+              keepAlive,
+              semaphores,
+              keyBag,
+              upcall,
+              messageIPC,
+              sandbox,
+              codeSigningIdentity,
+              extendedACL,
+              applicationLifecycle};
   install();
 }
 

@@ -7,6 +7,7 @@
 #include <string>
 #include <string_view>
 
+#include "platform/fake/fake_application_lifecycle.h"
 #include "platform/fake/fake_code_signing_identity.h"
 #include "platform/fake/fake_extended_acl.h"
 #include "platform/fake/fake_logging.h"
@@ -58,6 +59,7 @@ class FakeServices {
   std::shared_ptr<platform::FakeSandbox> sandbox;
   std::shared_ptr<platform::FakeCodeSigningIdentity> codeSigningIdentity;
   std::shared_ptr<platform::FakeExtendedACL> extendedACL;
+  std::shared_ptr<platform::FakeApplicationLifecycle> applicationLifecycle;
 };
 
 }  // namespace kestrel::testing

@@ -64,6 +64,10 @@ std::string describe(const platform::MessageDictionary& request) {
     out += (out.empty() ? "" : " ") + key + "=";
     if (auto u = value.uint64()) {
       out += "u64:" + std::to_string(*u);
+    } else if (auto i = value.int64()) {
+      out += "i64:" + std::to_string(*i);
+    } else if (auto uuid = value.uuid()) {
+      out += "uuid:" + uuid->string();
     } else if (auto b = value.boolean()) {
       out += std::string("bool:") + (*b ? "true" : "false");
     } else {
@@ -78,10 +82,19 @@ TEST(KestrelctlCommandsTest, BuildsTheRequestOfEachSubcommandOrSaysWhatIsMissing
   RequestOptions noIdentifier{2, 501, std::nullopt, false};
   RequestOptions noClass{std::nullopt, 501, std::nullopt, false};
   RequestOptions noUser{2, std::nullopt, std::nullopt, false};
+  const platform::Uuid uuid = *platform::Uuid::parse("E621E1F8-C36C-495A-93FC-0C247A3E6E5F");
+  RequestOptions info = full;
+  info.uuid = uuid;
+  info.key = "k";
+  info.value = PlistValue(7);
+  info.infoDictionary = true;
+  info.protectionClass = -3;
+  info.thirdParty = true;
+  const std::string named = "Identifier=str:com.example.app Key=str:k UUID=uuid:" + uuid.string();
   struct Row {
     Subcommand subcommand;
     const RequestOptions& options;
-    const char* request;  // or "error: " and the message
+    std::string request;  // or "error: " and the message
   };
   const Row rows[] = {
       {Subcommand::Create, full,
@@ -104,6 +117,22 @@ TEST(KestrelctlCommandsTest, BuildsTheRequestOfEachSubcommandOrSaysWhatIsMissing
       {Subcommand::Lookup, noUser, "error: --user is required"},
       {Subcommand::List, noClass, "error: --class is required"},
       {Subcommand::CodeSigningInfo, noClass, "error: --identifier is required"},
+      {Subcommand::InfoGet, info,
+       "Command=u64:6 ContainerClass=u64:2 " + named + " UserID=u64:501"},
+      {Subcommand::InfoSet, info,
+       "Command=u64:5 ContainerClass=u64:2 " + named + " UserID=u64:501 Value=i64:7"},
+      {Subcommand::InfoRemove, info,
+       "Command=u64:5 ContainerClass=u64:2 " + named + " UserID=u64:501"},
+      {Subcommand::Metadata, info,
+       "Command=u64:7 ContainerClass=u64:2 Identifier=str:com.example.app "
+       "InfoDictRequested=bool:true UUID=uuid:" +
+           uuid.string() + " UserID=u64:501"},
+      {Subcommand::SetProtectionClass, info,
+       "Command=u64:21 ContainerClass=u64:2 DataProtectionClass=i64:-3 "
+       "Identifier=str:com.example.app IsThirdParty=bool:true RetryIfLocked=bool:false "
+       "UserID=u64:501"},
+      {Subcommand::InfoGet, full, "error: --uuid is required"},
+      {Subcommand::SetProtectionClass, full, "error: --protection-class is required"},
   };
   for (const Row& row : rows) {
     const SubcommandInfo& info = subcommandInfo(row.subcommand);

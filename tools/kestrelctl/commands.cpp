@@ -23,6 +23,23 @@ constexpr std::array kSubcommands{
                    "Show the code-signing information recorded for an identifier"},
     SubcommandInfo{Subcommand::InvalidateCodeSigning, "invalidate-code-signing", 20, 0,
                    "Drop code-signing information of apps without a bundle container"},
+    SubcommandInfo{Subcommand::InfoGet, "info-get", 6,
+                   kOptionClass | kOptionUser | kOptionIdentifier | kOptionUUID | kOptionKey,
+                   "Show one info value of a container"},
+    SubcommandInfo{
+        Subcommand::InfoSet, "info-set", 5,
+        kOptionClass | kOptionUser | kOptionIdentifier | kOptionUUID | kOptionKey | kOptionValue,
+        "Set one info value of a container (the value as JSON)"},
+    SubcommandInfo{Subcommand::InfoRemove, "info-remove", 5,
+                   kOptionClass | kOptionUser | kOptionIdentifier | kOptionUUID | kOptionKey,
+                   "Remove one info value of a container"},
+    SubcommandInfo{
+        Subcommand::Metadata, "metadata", 7,
+        kOptionClass | kOptionUser | kOptionIdentifier | kOptionUUID | kOptionInfoDictionary,
+        "Show a container's metadata: path, transient, and its info with --info"},
+    SubcommandInfo{Subcommand::SetProtectionClass, "set-protection-class", 21,
+                   kOptionClass | kOptionUser | kOptionIdentifier | kOptionProtectionClass,
+                   "Move a data container's files to another data-protection class"},
 };
 
 // Kept here rather than linking the daemon's logic into the tool; the tests
@@ -82,6 +99,22 @@ bool buildRequest(const SubcommandInfo& info, const RequestOptions& options,
     *error = "--identifier is required";
     return false;
   }
+  if (info.takes(kOptionUUID) && !options.uuid) {
+    *error = "--uuid is required";
+    return false;
+  }
+  if (info.takes(kOptionKey) && !options.key) {
+    *error = "--key is required";
+    return false;
+  }
+  if (info.takes(kOptionValue) && !options.value) {
+    *error = "--value is required";
+    return false;
+  }
+  if (info.takes(kOptionProtectionClass) && !options.protectionClass) {
+    *error = "--protection-class is required";
+    return false;
+  }
 
   *request = platform::MessageDictionary();
   request->setUint64("Command", info.command);
@@ -95,6 +128,20 @@ bool buildRequest(const SubcommandInfo& info, const RequestOptions& options,
     request->setBoolean("CreateIfNecessary", info.subcommand == Subcommand::Create);
   }
   if (info.takes(kOptionTransient)) request->setBoolean("Transient", options.transient);
+  if (info.takes(kOptionUUID)) request->setUuid("UUID", *options.uuid);
+  if (info.takes(kOptionKey)) request->setString("Key", *options.key);
+  if (info.takes(kOptionValue) && !request->setPlist("Value", *options.value)) {
+    *error = "--value is nested too deep";
+    return false;
+  }
+  if (info.takes(kOptionInfoDictionary)) {
+    request->setBoolean("InfoDictRequested", options.infoDictionary);
+  }
+  if (info.takes(kOptionProtectionClass)) {
+    request->setInt64("DataProtectionClass", *options.protectionClass);
+    request->setBoolean("IsThirdParty", options.thirdParty);
+    request->setBoolean("RetryIfLocked", options.retryIfLocked);
+  }
   return true;
 }
 

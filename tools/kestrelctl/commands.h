@@ -9,6 +9,8 @@
 #include <string_view>
 
 #include "platform/message_ipc.h"
+#include "platform/plist.h"
+#include "platform/uuid.h"
 
 namespace kestrel::kestrelctl {
 
@@ -20,6 +22,11 @@ enum class Subcommand {
   SystemContainer,
   CodeSigningInfo,
   InvalidateCodeSigning,
+  InfoGet,
+  InfoSet,
+  InfoRemove,
+  Metadata,
+  SetProtectionClass,
 };
 
 // What a subcommand accepts on the command line (bit set).
@@ -29,6 +36,14 @@ enum SubcommandOption : unsigned {
   kOptionIdentifier = 1u << 2,          // --identifier, optional
   kOptionIdentifierRequired = 1u << 3,  // --identifier, required
   kOptionTransient = 1u << 4,           // --transient
+  // --uuid, the container's UUID; without it the container is looked up
+  // first (class, user, identifier) and its UUID and identifier are used.
+  kOptionUUID = 1u << 5,
+  kOptionKey = 1u << 6,             // --key, required
+  kOptionValue = 1u << 7,           // --value (JSON), required
+  kOptionInfoDictionary = 1u << 8,  // --info
+  kOptionProtectionClass =
+      1u << 9,  // --protection-class (required), --third-party, --retry-if-locked
 };
 
 struct SubcommandInfo {
@@ -51,11 +66,19 @@ struct RequestOptions {
   std::optional<std::uint64_t> userId;
   std::optional<std::string> identifier;
   bool transient = false;
+  std::optional<platform::Uuid> uuid = std::nullopt;
+  std::optional<std::string> key = std::nullopt;
+  std::optional<PlistValue> value = std::nullopt;
+  bool infoDictionary = false;
+  std::optional<std::int64_t> protectionClass = std::nullopt;
+  bool thirdParty = false;
+  bool retryIfLocked = false;
 };
 
 // The request for the subcommand: "Command" plus the keys it sends. An
 // identifier that is not given is left out, so that the daemon uses the
-// client's own. False, with a message, when a required option is missing.
+// client's own. False, with a message, when a required option is missing
+// (the UUID included: the caller looks the container up first).
 bool buildRequest(const SubcommandInfo& info, const RequestOptions& options,
                   platform::MessageDictionary* request, std::string* error);
 

@@ -219,6 +219,29 @@ std::string renderCodeSigningInfo(const MessageDictionary& reply) {
   return out;
 }
 
+std::string renderInfoValue(const MessageDictionary& reply) {
+  const MessageValue* value = reply.value("ReplyInfoValue");
+  if (!value) return std::string(kAbsent) + "\n";
+  std::string out;
+  renderValue(*value, 0, &out);
+  return out;
+}
+
+std::string renderMetadata(const MessageDictionary& reply) {
+  const MessageValue* transient = reply.value("ReplyTransient");
+  std::string out = renderFacts({
+      {"path", stringOrAbsent(reply.string("ReplyPath"))},
+      {"transient", transient && transient->boolean() ? (*transient->boolean() ? "yes" : "no")
+                                                      : std::string(kAbsent)},
+  });
+  if (const MessageDictionary* info = reply.dictionary("ReplyInfoDictionary")) {
+    if (info->empty()) return out + "info  (empty)\n";
+    out += "info\n";
+    renderDictionary(*info, 2, &out);
+  }
+  return out;
+}
+
 }  // namespace
 
 std::string renderReply(Subcommand subcommand, const MessageDictionary& reply) {
@@ -236,6 +259,16 @@ std::string renderReply(Subcommand subcommand, const MessageDictionary& reply) {
       return renderCodeSigningInfo(reply);
     case Subcommand::InvalidateCodeSigning:
       return "code-signing information invalidated\n";
+    case Subcommand::InfoGet:
+      return renderInfoValue(reply);
+    case Subcommand::InfoSet:
+      return "info value set\n";
+    case Subcommand::InfoRemove:
+      return "info value removed\n";
+    case Subcommand::Metadata:
+      return renderMetadata(reply);
+    case Subcommand::SetProtectionClass:
+      return "protection class set\n";
   }
   return {};
 }

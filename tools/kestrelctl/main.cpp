@@ -12,11 +12,14 @@
 // cannot be reached; 4 when it closed the connection without a reply (the
 // request was refused); 5 for a D-Bus error reply; 6 for a failure of the
 // tool itself.
+#include <fcntl.h>
 #include <CLI/CLI.hpp>
 #include <algorithm>
+#include <charconv>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <iostream>
 #include <iterator>
@@ -29,12 +32,14 @@
 #include "daemon/daemon_state.h"
 #include "fsck.h"
 #include "human_output.h"
+#include "platform/data_protection.h"
 #include "platform/linux/dbus_listener.h"
 #include "platform/linux/named_semaphores_linux.h"
 #include "platform/linux/upcall_client_linux.h"
 #include "platform/plist_serialization.h"
 #include "platform/root.h"
 #include "platform/services.h"
+#include "platform/unique_fd.h"
 #include "reply_json.h"
 #include "request_items.h"
 #include "upcall_command.h"
@@ -116,9 +121,20 @@ struct NamedArguments {
   std::string user;
   std::string identifier;
   bool transient = false;
+  std::string uuid;
+  std::string key;
+  std::string value;
+  bool infoDictionary = false;
+  std::string protectionClass;
+  bool thirdParty = false;
+  bool retryIfLocked = false;
   CLI::Option* classOption = nullptr;
   CLI::Option* userOption = nullptr;
   CLI::Option* identifierOption = nullptr;
+  CLI::Option* uuidOption = nullptr;
+  CLI::Option* keyOption = nullptr;
+  CLI::Option* valueOption = nullptr;
+  CLI::Option* protectionClassOption = nullptr;
 };
 
 void addNamedOptions(const kestrelctl::SubcommandInfo& info, NamedArguments* arguments) {
@@ -145,6 +161,56 @@ void addNamedOptions(const kestrelctl::SubcommandInfo& info, NamedArguments* arg
   if (info.takes(kestrelctl::kOptionTransient)) {
     sub->add_flag("--transient", arguments->transient, "The transient variant of the class");
   }
+  if (info.takes(kestrelctl::kOptionUUID)) {
+    arguments->uuidOption = sub->add_option(
+        "--uuid", arguments->uuid,
+        "The container's UUID (default: the one of the container the other options name)");
+  }
+  if (info.takes(kestrelctl::kOptionKey)) {
+    arguments->keyOption = sub->add_option("--key", arguments->key, "Info key")->required();
+  }
+  if (info.takes(kestrelctl::kOptionValue)) {
+    arguments->valueOption =
+        sub->add_option("--value", arguments->value, "The value, as JSON (e.g. 42, \"text\", {})")
+            ->required();
+  }
+  if (info.takes(kestrelctl::kOptionInfoDictionary)) {
+    sub->add_flag("--info", arguments->infoDictionary, "Show the info dictionary too");
+  }
+  if (info.takes(kestrelctl::kOptionProtectionClass)) {
+    arguments->protectionClassOption =
+        sub->add_option("--protection-class", arguments->protectionClass,
+                        "The data-protection class to move to (a signed number)")
+            ->required();
+    sub->add_flag("--third-party", arguments->thirdParty,
+                  "The app is a second- or third-party app (classes 0, 1 and 3 only)");
+    sub->add_flag("--retry-if-locked", arguments->retryIfLocked,
+                  "While the device is locked, wait for the next unlock (else: error 61)");
+  }
+}
+
+// The container named by class, user and (own) identifier, looked up: its
+// UUID and identifier go into the options. The exit status when that fails.
+std::optional<int> lookUpContainer(const std::string& address, std::uint64_t timeoutSeconds,
+                                   kestrelctl::RequestOptions* options) {
+  const kestrelctl::SubcommandInfo& lookup =
+      kestrelctl::subcommandInfo(kestrelctl::Subcommand::Lookup);
+  platform::MessageDictionary request;
+  std::string error;
+  if (!kestrelctl::buildRequest(lookup, *options, &request, &error)) {
+    std::cerr << "kestrelctl: " << error << "\n";
+    return kExitUsage;
+  }
+  const kestrelctl::CallOutcome outcome =
+      kestrelctl::callDaemon(address, kKSTServiceName, request, timeoutSeconds);
+  if (auto status = callFailure(outcome)) return status;
+  if (const std::uint64_t code = outcome.reply.uint64("ReplyError"); code != 1) {
+    std::cerr << kestrelctl::failureMessage(lookup.name, code) << "\n";
+    return kExitReplyError;
+  }
+  options->uuid = outcome.reply.uuid("ReplyUUID");
+  options->identifier = outcome.reply.string("ReplyIdentifier");
+  return std::nullopt;
 }
 
 int runNamed(const std::string& address, const kestrelctl::SubcommandInfo& info,
@@ -161,6 +227,34 @@ int runNamed(const std::string& address, const kestrelctl::SubcommandInfo& info,
     options.identifier = arguments.identifier;
   }
   options.transient = arguments.transient;
+  if (error.empty() && arguments.uuidOption && arguments.uuidOption->count() > 0) {
+    options.uuid = platform::Uuid::parse(arguments.uuid);
+    if (!options.uuid) error = "--uuid: \"" + arguments.uuid + "\" is not a UUID";
+  }
+  if (arguments.keyOption && arguments.keyOption->count() > 0) options.key = arguments.key;
+  if (error.empty() && arguments.valueOption && arguments.valueOption->count() > 0) {
+    std::string jsonError;
+    options.value = kestrelctl::plistFromJson(arguments.value, &jsonError);
+    if (!options.value) error = "--value: " + jsonError;
+  }
+  options.infoDictionary = arguments.infoDictionary;
+  if (error.empty() && arguments.protectionClassOption &&
+      arguments.protectionClassOption->count() > 0) {
+    std::int64_t number = 0;
+    const std::string& text = arguments.protectionClass;
+    const auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), number);
+    if (ec != std::errc() || end != text.data() + text.size() || text.empty()) {
+      error = "--protection-class: \"" + text + "\" is not a signed 64-bit number";
+    } else {
+      options.protectionClass = number;
+    }
+  }
+  options.thirdParty = arguments.thirdParty;
+  options.retryIfLocked = arguments.retryIfLocked;
+  if (error.empty() && info.takes(kestrelctl::kOptionUUID) && !options.uuid &&
+      options.containerClass && options.userId) {
+    if (auto status = lookUpContainer(address, timeoutSeconds, &options)) return *status;
+  }
 
   platform::MessageDictionary request;
   if (!error.empty() || !kestrelctl::buildRequest(info, options, &request, &error)) {
@@ -253,6 +347,33 @@ int runUpcall(const std::string& socketPath, const kestrelctl::UpcallRequestOpti
     return item.valueType == 0 && item.number;
   });
   return status != reply->items.end() && *status->number == 1 ? kExitSuccess : kExitReplyError;
+}
+
+// Prints the data-protection class of each item as the daemon reads it
+// (symbolic links are not followed), "-" for an item without one. Works on
+// the files alone; the daemon is not asked.
+int runProtectionClasses(const std::vector<std::string>& paths, bool json) {
+  nlohmann::json classes = nlohmann::json::object();
+  int status = kExitSuccess;
+  for (const std::string& path : paths) {
+    const platform::UniqueFd fd(
+        ::open(path.c_str(), O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
+    std::optional<std::int32_t> protectionClass;
+    const int error = fd ? platform::getProtectionClass(fd.get(), &protectionClass) : errno;
+    if (error != 0) {
+      std::cerr << "kestrelctl: " << path << ": " << std::strerror(error) << "\n";
+      status = kExitReplyError;
+      continue;
+    }
+    if (json) {
+      classes[path] = protectionClass ? nlohmann::json(*protectionClass) : nlohmann::json();
+    } else {
+      std::cout << (protectionClass ? std::to_string(*protectionClass) : "-") << "  " << path
+                << "\n";
+    }
+  }
+  if (json) std::cout << classes.dump(2) << "\n";
+  return status;
 }
 
 // Removes the mark that the boot-time work was done for this root, so that
@@ -376,6 +497,12 @@ int run(int argc, char** argv) {
       app.add_subcommand("plist", "Print a property-list file (e.g. a metadata file) as JSON");
   plist->add_option("file", plistFile, "The file")->required();
 
+  std::vector<std::string> protectionPaths;
+  CLI::App* protectionClass = app.add_subcommand(
+      "protection-class", "Print the data-protection class of files and directories");
+  protectionClass->add_option("paths", protectionPaths, "The items")->required();
+  protectionClass->fallthrough();
+
   bool offline = false;
   CLI::App* fsck = app.add_subcommand(
       "fsck", "Check the container store beneath the root (and the daemon's cache of it)");
@@ -427,6 +554,7 @@ int run(int argc, char** argv) {
   }
 
   if (plist->parsed()) return runPlist(plistFile);
+  if (protectionClass->parsed()) return runProtectionClasses(protectionPaths, json);
   const platform::FilesystemRoot filesystemRoot =
       root.empty() ? platform::FilesystemRoot::fromEnvironment() : platform::FilesystemRoot(root);
   if (address.empty()) {

@@ -12,6 +12,8 @@
 #include <cstring>
 #include <system_error>
 
+#include "platform/unique_fd.h"
+
 namespace kestrel::platform {
 
 namespace {
@@ -23,22 +25,6 @@ constexpr std::string_view kLogindSource = "logind";
 // Session uids below this belong to system accounts, not to people.
 constexpr uid_t kFirstHumanUid = 501;
 constexpr std::string_view kWhitespace = " \t\r\n\v\f";
-
-class UniqueFd {
- public:
-  explicit UniqueFd(int fd = -1) : fd_(fd) {}
-  ~UniqueFd() {
-    if (fd_ >= 0) ::close(fd_);
-  }
-  UniqueFd(const UniqueFd&) = delete;
-  UniqueFd& operator=(const UniqueFd&) = delete;
-
-  int get() const { return fd_; }
-  bool valid() const { return fd_ >= 0; }
-
- private:
-  int fd_;
-};
 
 struct FreeDeleter {
   void operator()(void* p) const { std::free(p); }
@@ -131,11 +117,21 @@ int parseLockState(std::string_view content) {
   return value;
 }
 
-LinuxKeyBag::LinuxKeyBag(FilesystemRoot root) : root_(std::move(root)) {}
+LinuxKeyBag::LinuxKeyBag(FilesystemRoot root)
+    : root_(std::move(root)), stateWatch_(root_.resolve(kStateDirectory), root_.resolve("/")) {}
 
 LinuxKeyBag::~LinuxKeyBag() = default;
 
 int LinuxKeyBag::lockState() {
+  const std::lock_guard lock(stateMutex_);
+  if (stateWatched_ && !stateWatch_.changed()) return cachedState_;
+  // Watch first: a change made while the file is read is seen next time.
+  stateWatched_ = stateWatch_.arm();
+  cachedState_ = readLockState();
+  return cachedState_;
+}
+
+int LinuxKeyBag::readLockState() const {
   std::string content;
   const int rc =
       readFile(root_.resolve(kStateDirectory) + "/" + std::string(kLockStateName), &content);

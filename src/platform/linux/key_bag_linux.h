@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "platform/key_bag.h"
+#include "platform/linux/directory_watch_linux.h"
 #include "platform/root.h"
 
 namespace kestrel::platform {
@@ -23,7 +24,10 @@ class LinuxKeyBag final : public KeyBag {
   LinuxKeyBag& operator=(const LinuxKeyBag&) = delete;
 
   // "0" unlocked, "1" locked, another integer as itself; a missing file reads as
-  // unlocked, and content that is not an integer as -1.
+  // unlocked, and content that is not an integer as -1. The state read is
+  // kept and read again only when an inotify watch on the file's directory
+  // saw a change there: asking costs one non-blocking read (it is asked for
+  // every protection-class change of a walk), and a write is seen at once.
   int lockState() override;
   // Watches <root>/run/kestrel (made if missing) with inotify; the handler runs on
   // the queue whenever the lock-state file is written, replaced or removed. The
@@ -38,9 +42,17 @@ class LinuxKeyBag final : public KeyBag {
  private:
   struct Watch;
 
+  // The lock-state file, read afresh.
+  int readLockState() const;
+
   FilesystemRoot root_;
   std::mutex mutex_;
   std::vector<std::unique_ptr<Watch>> watches_;
+
+  std::mutex stateMutex_;  // guards what follows
+  DirectoryChangeWatch stateWatch_;
+  bool stateWatched_ = false;  // the watch covered the directory when cachedState_ was read
+  int cachedState_ = kUnlocked;
 };
 
 // Parses the lock-state file's content as lockState() reads it.

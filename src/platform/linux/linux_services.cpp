@@ -2,6 +2,7 @@
 #include <memory>
 
 #include "platform/linux/accounts_linux.h"
+#include "platform/linux/application_lifecycle_linux.h"
 #include "platform/linux/code_signing_identity_linux.h"
 #include "platform/linux/dbus_listener.h"
 #include "platform/linux/device_info_linux.h"
@@ -30,6 +31,8 @@ Services makeLinuxServices(const FilesystemRoot& root) {
   services.sandbox = std::make_shared<LinuxSandbox>();
   services.codeSigningIdentity = std::make_shared<LinuxCodeSigningIdentity>(root);
   services.extendedACL = std::make_shared<LinuxExtendedACL>(services.accounts);
+  services.applicationLifecycle =
+      std::make_shared<LinuxApplicationLifecycle>(services.codeSigningIdentity);
   return services;
 }
 

@@ -77,7 +77,55 @@ std::optional<std::string> pathOf(int fd) {
   return std::string(buffer.data(), static_cast<std::size_t>(length));
 }
 
+// The label an LSM gave the process, as /proc shows it.
+std::optional<std::string> processSecurityLabel(pid_t pid) {
+  const UniqueFd fd(
+      ::open(("/proc/" + std::to_string(pid) + "/attr/current").c_str(), O_RDONLY | O_CLOEXEC));
+  if (!fd) return std::nullopt;
+  char buffer[256];
+  const ssize_t length = ::read(fd.get(), buffer, sizeof buffer);
+  if (length <= 0) return std::nullopt;  // EINVAL: no LSM keeps labels
+  std::string label(buffer, static_cast<std::size_t>(length));
+  while (!label.empty() && (label.back() == '\0' || label.back() == '\n')) label.pop_back();
+  if (label.empty()) return std::nullopt;
+  return label;
+}
+
+// The executable of the process and its status, kept only when the pidfd's
+// process is still alive once they were read (so that they are not those
+// of a process that took over the pid).
+void readExecutable(pid_t pid, const UniqueFd& pidfd, PeerCredentials* peer) {
+  if (pid <= 0) return;
+  // The path is read from the opened file, so the two name the same file
+  // even if the process executes another program meanwhile.
+  UniqueFd executable = openExecutable(pid);
+  auto path = executable ? pathOf(executable.get()) : std::nullopt;
+  struct stat status {};
+  if (path && ::fstat(executable.get(), &status) == 0 && pidfd && pidfdAlive(pidfd.get())) {
+    peer->executablePath = std::move(path);
+    peer->executableStatus = status;
+  }
+}
+
 }  // namespace
+
+PeerCredentials readProcessCredentials(pid_t pid) {
+  PeerCredentials peer;
+  peer.pid = pid;
+  peer.uid = static_cast<uid_t>(-1);
+  peer.gid = static_cast<gid_t>(-1);
+  UniqueFd pidfd(static_cast<int>(::syscall(SYS_pidfd_open, pid, 0)));
+  if (!pidfd) return peer;
+  struct stat owner {};
+  if (::stat(("/proc/" + std::to_string(pid)).c_str(), &owner) == 0) {
+    peer.uid = owner.st_uid;
+    peer.gid = owner.st_gid;
+  }
+  peer.securityLabel = processSecurityLabel(pid);
+  readExecutable(pid, pidfd, &peer);
+  peer.pidfd = std::make_shared<UniqueFd>(std::move(pidfd));
+  return peer;
+}
 
 PeerCredentials readPeerCredentials(int socketFd) {
   PeerCredentials peer;
@@ -95,17 +143,7 @@ PeerCredentials readPeerCredentials(int socketFd) {
   peer.securityLabel = securityLabel(socketFd);
 
   UniqueFd pidfd = peerPidfd(socketFd, cred.pid);
-  if (cred.pid > 0) {
-    // The path is read from the opened file, so the two name the same file
-    // even if the process executes another program meanwhile.
-    UniqueFd executable = openExecutable(cred.pid);
-    auto path = executable ? pathOf(executable.get()) : std::nullopt;
-    struct stat status {};
-    if (path && ::fstat(executable.get(), &status) == 0 && pidfd && pidfdAlive(pidfd.get())) {
-      peer.executablePath = std::move(path);
-      peer.executableStatus = status;
-    }
-  }
+  readExecutable(cred.pid, pidfd, &peer);
   if (pidfd) peer.pidfd = std::make_shared<UniqueFd>(std::move(pidfd));
   return peer;
 }

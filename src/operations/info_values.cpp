@@ -1,0 +1,173 @@
+// A container's info dictionary, one value at a time, and its whole metadata
+// record. Each finds the container in the cache by user, class, identifier
+// and internal UUID, and serialises on the identifier lock of that UUID's
+// text: a set holds it for writing from the read of the old dictionary to
+// the cache update, so two sets of one container never lose each other's key.
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "daemon/client_connection.h"
+#include "daemon/error_codes.h"
+#include "daemon/errors.h"
+#include "daemon/exceptions.h"
+#include "daemon/locks.h"
+#include "store/container_cache.h"
+#include "store/container_class.h"
+
+namespace kestrel {
+
+namespace {
+
+// Error 11 when the container cannot even be named: no UUID, or no class.
+KSTErrorRef invalidAddress(const char* function, std::uint32_t userId,
+                           const std::optional<platform::Uuid>& uuid,
+                           KSTContainerClass containerClass) {
+  if (uuid && KSTIsValidContainerClass(containerClass)) return nullptr;
+  return KST_ERROR_IN(function, kKSTErrorInvalidObject, nullptr, true,
+                      "Can't act on an invalid object: userId: %u, UUID: %@, Class: %ld", userId,
+                      uuid, containerClass);
+}
+
+// The cached container of the address, or error 21 on behalf of the operation.
+KSTMetadataRef cachedContainer(const char* function, std::uint32_t userId,
+                               const std::string& uuidString,
+                               const std::optional<std::string>& identifier,
+                               KSTContainerClass containerClass, KSTErrorRef* error) {
+  std::optional<std::string_view> name;
+  if (identifier) name = *identifier;
+  KSTMetadataRef container = KSTContainerCache::sharedInstance().containerForUser(
+      userId, containerClass, name, uuidString);
+  if (!container) {
+    *error = KST_ERROR_IN(function, kKSTErrorNotFound, nullptr, true,
+                          "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld",
+                          userId, uuidString, identifier, containerClass);
+  }
+  return container;
+}
+
+}  // namespace
+
+void KSTClientConnection::setInfoValue(const std::optional<PlistValue>& value,
+                                       const std::optional<std::string>& forKey,
+                                       std::uint32_t userId,
+                                       const std::optional<platform::Uuid>& uuid,
+                                       const std::optional<std::string>& identifier,
+                                       KSTContainerClass containerClass, bool useLocking,
+                                       std::uint64_t* withError) {
+  if (KSTErrorRef invalid = invalidAddress(__func__, userId, uuid, containerClass)) {
+    KSTHandOverCode(invalid, withError);
+    return;
+  }
+  if (!forKey) {
+    KSTHandOverCode(KST_ERROR(kKSTErrorInvalidParameter, nullptr, true,
+                              "Can't set nil or non-Strand key: %@", forKey),
+                    withError);
+    return;
+  }
+
+  const char* const function = __func__;
+  KST_CATCH_EXCEPTIONS(withError, [&] {
+    const std::string uuidString = uuid->string();
+    std::optional<KSTIdentifierLockGuard> lock;
+    if (useLocking) lock.emplace(uuidString, kKSTLockForWriting);
+
+    KSTErrorRef failure;
+    const KSTMetadataRef container =
+        cachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
+    if (!container) {
+      KSTHandOverCode(failure, withError);
+      return;
+    }
+
+    const std::optional<PlistDictionary> before = container->info();
+    PlistDictionary info = before.value_or(PlistDictionary{});
+    if (value) {
+      info.insert_or_assign(*forKey, *value);
+    } else {
+      info.erase(*forKey);
+    }
+    container->setInfo(std::move(info));
+    if (!container->writeMetadataToDiskWithError(&failure)) {
+      // The record keeps agreeing with its file.
+      container->setInfo(before);
+      KSTHandOverCode(failure, withError);
+      return;
+    }
+
+    const KSTFileURL url = container->url();
+    const bool transient = container->transient();
+    KSTErrorRef cacheError;
+    if (!KSTContainerCache::sharedInstance().addContainerMetadata(container, userId, url, transient,
+                                                                  &cacheError)) {
+      KSTHandOverCode(KST_ERROR_IN(function, kKSTErrorCacheAddFailed, cacheError, true,
+                                   "Failed to add to cache: %@, url: %@, transient: %d", container,
+                                   url, transient ? 1 : 0),
+                      withError);
+    }
+  });
+}
+
+std::optional<PlistValue> KSTClientConnection::infoValueForKey(
+    const std::optional<std::string>& key, std::uint32_t userId,
+    const std::optional<platform::Uuid>& uuid, const std::optional<std::string>& identifier,
+    KSTContainerClass containerClass, bool useLocking, std::uint64_t* withError) {
+  if (KSTErrorRef invalid = invalidAddress(__func__, userId, uuid, containerClass)) {
+    KSTHandOverCode(invalid, withError);
+    return std::nullopt;
+  }
+  if (!key) {
+    KSTHandOverCode(KST_ERROR(kKSTErrorInvalidParameter, nullptr, true,
+                              "Can't get nil or non-Strand key: %@", key),
+                    withError);
+    return std::nullopt;
+  }
+
+  const char* const function = __func__;
+  using Result = std::optional<PlistValue>;
+  return KST_CATCH_EXCEPTIONS(withError, std::nullopt, [&]() -> Result {
+    const std::string uuidString = uuid->string();
+    std::optional<KSTIdentifierLockGuard> lock;
+    if (useLocking) lock.emplace(uuidString, kKSTLockForReading);
+
+    KSTErrorRef failure;
+    const KSTMetadataRef container =
+        cachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
+    if (!container) {
+      KSTHandOverCode(failure, withError);
+      return std::nullopt;
+    }
+    const std::optional<PlistDictionary> info = container->info();
+    if (info) {
+      if (const auto found = info->find(*key); found != info->end()) return found->second;
+    }
+    // An ordinary answer, not a fault: no log line.
+    KSTHandOverCode(KST_ERROR_IN(function, kKSTErrorInfoValueNotFound, nullptr, false,
+                                 "Didn't find info value for key: %@", key),
+                    withError);
+    return std::nullopt;
+  });
+}
+
+KSTMetadataRef KSTClientConnection::metadataForUser(std::uint32_t userId,
+                                                    const std::optional<platform::Uuid>& withUUID,
+                                                    const std::optional<std::string>& identifier,
+                                                    KSTContainerClass containerClass,
+                                                    std::uint64_t* withError) {
+  if (KSTErrorRef invalid = invalidAddress(__func__, userId, withUUID, containerClass)) {
+    KSTHandOverCode(invalid, withError);
+    return nullptr;
+  }
+  const char* const function = __func__;
+  return KST_CATCH_EXCEPTIONS(withError, nullptr, [&]() -> KSTMetadataRef {
+    const std::string uuidString = withUUID->string();
+    const KSTIdentifierLockGuard lock(uuidString, kKSTLockForReading);
+    KSTErrorRef failure;
+    KSTMetadataRef container =
+        cachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
+    if (!container) KSTHandOverCode(failure, withError);
+    return container;
+  });
+}
+
+}  // namespace kestrel
