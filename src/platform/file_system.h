@@ -52,8 +52,11 @@ int copyTree(const char* from, const char* to);
 // absolute or escaping symbolic link, a magic link or a mount point
 // (openat2 with RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV),
 // whatever is renamed or swapped meanwhile. An empty relativePath opens
-// baseFd's directory itself. EXDEV or ELOOP for a path that would leave it,
-// ENOSYS on a kernel without openat2.
+// baseFd's directory itself. EXDEV or ELOOP for a path that would leave it.
+// Where openat2 is refused (a kernel before 5.6, or a system-call filter that
+// cannot inspect its flags, as systemd's RestrictSUIDSGID=), the path is
+// walked one name at a time instead (linux/open_beneath_linux.h), which
+// follows no link at all.
 int openBeneath(int baseFd, const char* relativePath, int flags, int* fd);
 
 // --- File flags ----------------------------------------------------------------------------

@@ -5,7 +5,6 @@
 #include <fcntl.h>
 #include <fts.h>
 #include <linux/fs.h>
-#include <linux/openat2.h>
 #include <sys/syscall.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
@@ -401,22 +400,6 @@ int writeAtomically(const char* path, std::span<const std::uint8_t> contents,
 int treeRemove(const char* path, const TreeRemoveErrorCallback& onItemError) {
   long failures = 0;
   return removeTree(path, onItemError, failures, kArrivalRetries);
-}
-
-int openBeneath(int baseFd, const char* relativePath, int flags, int* fd) {
-  open_how how{};
-  how.flags = static_cast<std::uint64_t>(flags | O_CLOEXEC);
-  how.resolve = RESOLVE_BENEATH | RESOLVE_NO_MAGICLINKS | RESOLVE_NO_XDEV;
-  const char* path = relativePath != nullptr && *relativePath != '\0' ? relativePath : ".";
-  for (;;) {
-    const long opened = ::syscall(SYS_openat2, baseFd, path, &how, sizeof how);
-    if (opened >= 0) {
-      *fd = static_cast<int>(opened);
-      return 0;
-    }
-    // A rename elsewhere on the system may make the kernel ask for a retry.
-    if (errno != EAGAIN && errno != EINTR) return errno;
-  }
 }
 
 int makePath(const char* path, mode_t mode) {
