@@ -105,7 +105,8 @@ TEST_F(ContainerEndToEndTest, StagedContentStaysInItsSystemGroupContainer) {
     return call("stager", {"26", "Identifier=str:systemgroup.com.example.shared",
                            "SourcePath=str:" + source, "DestPath=str:" + dest});
   };
-  EXPECT_EQ(stage("item", "staged").exitStatus, 0);
+  auto staged = stage("item", "staged");
+  EXPECT_EQ(staged.exitStatus, 0) << staged.output << log();
   EXPECT_TRUE(fs::exists(group + "/staged"));
   auto escaped = stage("etc/passwd", "stolen");
   EXPECT_NE(escaped.output.find("\"ReplyError\": 10"), std::string::npos) << escaped.output;
