@@ -79,8 +79,8 @@ max_len_for() {
     return
   fi
   case "$1" in
-    fuzz_request_decoding | fuzz_dbus_message_codec | fuzz_path_confinement | fuzz_upcall_demux |
-      fuzz_upcall_packbuff) echo 1024 ;;
+    fuzz_request_decoding | fuzz_dbus_message_codec | fuzz_path_confinement) echo 1024 ;;
+    fuzz_upcall_demux | fuzz_upcall_packbuff) echo 1024 ;;
     *) echo 4096 ;;
   esac
 }
