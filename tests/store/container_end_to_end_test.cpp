@@ -1,6 +1,7 @@
 // Commands 0, 1 and 15 through the real daemon, from clients of different
 // identities and rights.
 #include <gtest/gtest.h>
+#include <sys/stat.h>
 
 #include <signal.h>
 
@@ -45,6 +46,13 @@ TEST_F(ContainerEndToEndTest, AppGetsItsOwnContainersAndTheInstallerListsThem) {
   const std::string path = fact(made.output, "path");
   EXPECT_TRUE(fs::exists(path + "/.com.zorvane.kestrel.metadata.plist")) << made.output;
   EXPECT_TRUE(fs::is_directory(path + "/Library/Preferences"));
+  // The user's own, down to its sub-directories (under the unit, CAP_CHOWN).
+  for (const std::string& item : {path, path + "/Library/Preferences"}) {
+    struct stat status {};
+    ASSERT_EQ(::stat(item.c_str(), &status), 0) << item;
+    EXPECT_EQ(status.st_uid, 501u) << item;
+    EXPECT_EQ(status.st_gid, 501u) << item;
+  }
 
   auto again = ctl("app-client", {"lookup", "--class", "2", "--user", "1"});
   ASSERT_EQ(again.exitStatus, 0) << again.output;
