@@ -7,7 +7,7 @@ packages=(
   libsystemd-dev libplist-dev libspdlog-dev libfmt-dev libacl1-dev libattr1-dev uuid-dev
   libcli11-dev nlohmann-json3-dev scdoc
   googletest libgtest-dev libgmock-dev libbenchmark-dev
-  acl systemd strace util-linux
+  acl systemd strace util-linux bubblewrap
 )
 missing=()
 for p in "${packages[@]}"; do
