@@ -1,0 +1,35 @@
+#!/usr/bin/env bash
+# The launch benchmark: starts kestreld (release build) on a fresh scratch
+# root, then times kestrel-run from its start to the first instruction of a
+# program it starts in an app's containers (made by the first launch),
+# against bwrap started directly with the same command line, alternating,
+# and writes bench/results/launch-<stamp>/result.txt.
+#
+#   bench/launch.sh [rounds]      # default 200 of each
+set -euo pipefail
+here="$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)"
+source_dir="$(dirname "$here")"
+build_dir="$source_dir/build/bench"
+rounds="${1:-200}"
+"$source_dir/scripts/setup.sh"
+
+cmake -S "$source_dir" -B "$build_dir" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
+  -DKESTREL_BUILD_BENCHMARKS=ON -DKESTREL_BUILD_TESTS=OFF >/dev/null
+cmake --build "$build_dir" --target kestreld kestrelctl kestrel-run kestrel_launch_bench \
+  kestrel_launch_stamp -j2
+
+root="$("$source_dir/tools/make-scratch-root.sh")"
+KESTREL_ROOT="$root" "$build_dir/kestreld" 2>/dev/null &
+pid=$!
+trap 'kill -TERM $pid 2>/dev/null || true; wait $pid 2>/dev/null || true; KESTRELCTL="$build_dir/tools/kestrelctl" "$source_dir/tools/remove-scratch-root.sh" "$root"' EXIT
+for _ in $(seq 200); do [[ -S "$root/run/kestrel/com.zorvane.kestreld.upcall" ]] && break; sleep 0.05; done
+
+out="$here/results/launch-$(date -u +%Y%m%dT%H%M%SZ)"
+mkdir -p "$out"
+"$build_dir/bench/kestrel_launch_bench" --rounds "$rounds" -- \
+  "$build_dir/tools/kestrel-run" --root "$root" --identifier com.zorvane.kestrel.bench.app \
+  --user 501 --group group.com.zorvane.kestrel.bench -- "$build_dir/bench/kestrel_launch_stamp" |
+  tee "$out/result.txt"
+echo "machine: $(nproc) cores, $(uname -r), $(date -u +%Y-%m-%d), load $(cut -d' ' -f1-3 /proc/loadavg)" |
+  tee "$out/machine.txt"
+echo "results: $out"
