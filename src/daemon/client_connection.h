@@ -158,6 +158,32 @@ class KSTClientConnection {
                                  const std::optional<std::string>& identifier,
                                  KSTContainerClass containerClass, std::uint64_t* withError);
 
+  // Repairs (operations/structure_repair.cpp) of the cached container of the
+  // user, class, identifier and internal UUID, each holding the identifier
+  // lock of that UUID's text for writing throughout. Recreating puts back the
+  // class's default sub-directories (and resets the ACLs of a system
+  // container); regenerating renames the container directory to a new random
+  // UUID in the same class directory and points the sandbox mapping and the
+  // cache there, its internal UUID unchanged. Codes: 11, 21, 45, 48 and those
+  // of the sub-directory and ACL operations.
+  void recreateDefaultStructureForUser(std::uint32_t userId,
+                                       const std::optional<platform::Uuid>& withUUID,
+                                       const std::optional<std::string>& identifier,
+                                       KSTContainerClass containerClass, std::uint64_t* withError);
+  void regenerateDirectoryUUIDForUser(std::uint32_t userId,
+                                      const std::optional<platform::Uuid>& withInternalUUID,
+                                      const std::optional<std::string>& identifier,
+                                      KSTContainerClass containerClass, std::uint64_t* withError);
+
+  // Disk usage (operations/disk_usage.cpp): the bytes the container's files
+  // take, measured under the UUID's identifier lock held for writing. A bundle
+  // container's figure is kept in its info dictionary and reused; data
+  // containers are measured every time. 0 with 11 or 21; failures to read or
+  // keep the figure are logged and change nothing.
+  std::uint64_t diskUsageForUserId(std::uint32_t userId, const std::optional<platform::Uuid>& uuid,
+                                   const std::optional<std::string>& identifier,
+                                   KSTContainerClass containerClass, std::uint64_t* withError);
+
   // Start-up and boot housekeeping of the container store.
   void rebootContainerManagerSetup();
   void containerManagerSetup();

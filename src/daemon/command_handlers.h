@@ -32,6 +32,12 @@ void KSTHandleSetInfoValue(KSTCommandContext& context);
 void KSTHandleGetInfoValue(KSTCommandContext& context);
 void KSTHandleGetMetadata(KSTCommandContext& context);
 
+// 8 and 22: recreate a container's default structure; 9: give its directory a
+// new UUID; 23: its disk usage ("ReplyDiskUsage", also after a failure).
+void KSTHandleRecreateDefaultStructure(KSTCommandContext& context);
+void KSTHandleRegenerateDirectoryUUID(KSTCommandContext& context);
+void KSTHandleDiskUsage(KSTCommandContext& context);
+
 // 13: the app-group container paths of an identifier; 14: its app-group ids.
 void KSTHandleAppGroupContainerPaths(KSTCommandContext& context);
 void KSTHandleAppGroupIdentifiers(KSTCommandContext& context);

@@ -16,8 +16,10 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {5, KSTHandleSetInfoValue, kKSTEntitlementAllowed, 1},      // set an info value
       {6, KSTHandleGetInfoValue, kKSTEntitlementAllowed, 1},      // get an info value
       {7, KSTHandleGetMetadata, kKSTEntitlementAllowed, 1},       // get a container's metadata
-      {8, nullptr, kKSTEntitlementAllowed, 1},                    // recreate the default structure
-      {9, nullptr, kKSTEntitlementAllowed, 1},                    // give a container a new UUID
+      {8, KSTHandleRecreateDefaultStructure, kKSTEntitlementAllowed,
+       1},  // recreate the default structure
+      {9, KSTHandleRegenerateDirectoryUUID, kKSTEntitlementAllowed,
+       1},                                                        // give a container a new UUID
       {10, KSTHandleDeleteContainer, kKSTEntitlementAllowed, 1},  // delete a container
       {11, KSTHandleWipePluginContainer, kKSTEntitlementWipeContainer,
        1},                                                      // wipe a plug-in data container
@@ -37,8 +39,9 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {20, KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kKSTEntitlementAllowed,
        1},  // invalidate apps without bundles
       {21, KSTHandleSetDataProtection, kKSTEntitlementAllowed, 0},  // set a container's protection
-      {22, nullptr, kKSTEntitlementAllowed, 1},             // recreate the default structure
-      {23, nullptr, kKSTEntitlementAllowed, 1},             // measure disk usage
+      {22, KSTHandleRecreateDefaultStructure, kKSTEntitlementAllowed,
+       1},                                                  // recreate the default structure
+      {23, KSTHandleDiskUsage, kKSTEntitlementAllowed, 1},  // measure disk usage
       {24, nullptr, kKSTEntitlementDataMigration, 1},       // the data-migration migration
       {25, KSTHandleRetryTest, kKSTEntitlementAllowed, 1},  // retry test (internal builds)
       {26, KSTHandleStageSharedContent, kKSTEntitlementStageSharedContent,

@@ -5,48 +5,17 @@
 // the cache update, so two sets of one container never lose each other's key.
 #include <optional>
 #include <string>
-#include <string_view>
 
 #include "daemon/client_connection.h"
 #include "daemon/error_codes.h"
 #include "daemon/errors.h"
 #include "daemon/exceptions.h"
 #include "daemon/locks.h"
+#include "operations/container_address.h"
 #include "store/container_cache.h"
 #include "store/container_class.h"
 
 namespace kestrel {
-
-namespace {
-
-// Error 11 when the container cannot even be named: no UUID, or no class.
-KSTErrorRef invalidAddress(const char* function, std::uint32_t userId,
-                           const std::optional<platform::Uuid>& uuid,
-                           KSTContainerClass containerClass) {
-  if (uuid && KSTIsValidContainerClass(containerClass)) return nullptr;
-  return KST_ERROR_IN(function, kKSTErrorInvalidObject, nullptr, true,
-                      "Can't act on an invalid object: userId: %u, UUID: %@, Class: %ld", userId,
-                      uuid, containerClass);
-}
-
-// The cached container of the address, or error 21 on behalf of the operation.
-KSTMetadataRef cachedContainer(const char* function, std::uint32_t userId,
-                               const std::string& uuidString,
-                               const std::optional<std::string>& identifier,
-                               KSTContainerClass containerClass, KSTErrorRef* error) {
-  std::optional<std::string_view> name;
-  if (identifier) name = *identifier;
-  KSTMetadataRef container = KSTContainerCache::sharedInstance().containerForUser(
-      userId, containerClass, name, uuidString);
-  if (!container) {
-    *error = KST_ERROR_IN(function, kKSTErrorNotFound, nullptr, true,
-                          "No Container with userId: %u UUID: %@, identifier: %@, Class: %ld",
-                          userId, uuidString, identifier, containerClass);
-  }
-  return container;
-}
-
-}  // namespace
 
 void KSTClientConnection::setInfoValue(const std::optional<PlistValue>& value,
                                        const std::optional<std::string>& forKey,
@@ -55,7 +24,7 @@ void KSTClientConnection::setInfoValue(const std::optional<PlistValue>& value,
                                        const std::optional<std::string>& identifier,
                                        KSTContainerClass containerClass, bool useLocking,
                                        std::uint64_t* withError) {
-  if (KSTErrorRef invalid = invalidAddress(__func__, userId, uuid, containerClass)) {
+  if (KSTErrorRef invalid = KSTInvalidContainerAddress(__func__, userId, uuid, containerClass)) {
     KSTHandOverCode(invalid, withError);
     return;
   }
@@ -74,7 +43,7 @@ void KSTClientConnection::setInfoValue(const std::optional<PlistValue>& value,
 
     KSTErrorRef failure;
     const KSTMetadataRef container =
-        cachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
+        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
     if (!container) {
       KSTHandOverCode(failure, withError);
       return;
@@ -112,7 +81,7 @@ std::optional<PlistValue> KSTClientConnection::infoValueForKey(
     const std::optional<std::string>& key, std::uint32_t userId,
     const std::optional<platform::Uuid>& uuid, const std::optional<std::string>& identifier,
     KSTContainerClass containerClass, bool useLocking, std::uint64_t* withError) {
-  if (KSTErrorRef invalid = invalidAddress(__func__, userId, uuid, containerClass)) {
+  if (KSTErrorRef invalid = KSTInvalidContainerAddress(__func__, userId, uuid, containerClass)) {
     KSTHandOverCode(invalid, withError);
     return std::nullopt;
   }
@@ -132,7 +101,7 @@ std::optional<PlistValue> KSTClientConnection::infoValueForKey(
 
     KSTErrorRef failure;
     const KSTMetadataRef container =
-        cachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
+        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
     if (!container) {
       KSTHandOverCode(failure, withError);
       return std::nullopt;
@@ -154,7 +123,8 @@ KSTMetadataRef KSTClientConnection::metadataForUser(std::uint32_t userId,
                                                     const std::optional<std::string>& identifier,
                                                     KSTContainerClass containerClass,
                                                     std::uint64_t* withError) {
-  if (KSTErrorRef invalid = invalidAddress(__func__, userId, withUUID, containerClass)) {
+  if (KSTErrorRef invalid =
+          KSTInvalidContainerAddress(__func__, userId, withUUID, containerClass)) {
     KSTHandOverCode(invalid, withError);
     return nullptr;
   }
@@ -164,7 +134,7 @@ KSTMetadataRef KSTClientConnection::metadataForUser(std::uint32_t userId,
     const KSTIdentifierLockGuard lock(uuidString, kKSTLockForReading);
     KSTErrorRef failure;
     KSTMetadataRef container =
-        cachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
+        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
     if (!container) KSTHandOverCode(failure, withError);
     return container;
   });

@@ -122,6 +122,14 @@ class KSTFileManager {
   // Logs every item of the tree at error level (used for orphaned data).
   void printDirectoryStructureAtURL(const KSTFileURL& url) const;
 
+  // --- Disk usage (operations/disk_usage.cpp) ---
+
+  // The allocated bytes of every file beneath the directory at url, each
+  // hard-linked file counted once; directories add nothing, symbolic links are
+  // never followed and other file systems never entered. Whatever cannot be
+  // read is logged and left out; 0 for a URL without a path.
+  std::uint64_t diskUsageForURL(const KSTFileURL& url) const;
+
   // --- Path confinement (store/path_confinement.cpp) ---
 
   // The real path of url when it lies within ifChildOfURL once links and the

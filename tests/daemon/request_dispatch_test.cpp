@@ -150,8 +150,6 @@ TEST_F(RequestDispatchTest, RequestsThatCannotBeServedCloseTheConnectionWithoutR
       // The index is logged as a signed number.
       {"huge command index", std::uint64_t{1} << 63, true, false,
        "Invalid command index: -9223372036854775808"},
-      {"structure repair, not served by this build yet", 8, true, false,
-       "Command 8 is not available"},
       {"no reply context", 25, false, false, "Dictionary does not have reply context"},
       // The customer build's answer is checked end to end.
       {"retry test on an internal build", 25, true, true, nullptr},

@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 
 #include <signal.h>
+#include <sys/stat.h>
 
 #include <algorithm>
 #include <filesystem>
@@ -90,6 +91,67 @@ TEST_F(ContainerEndToEndTest, AppGetsItsOwnContainersAndTheInstallerListsThem) {
                                        "com.example.while-locked"});
   EXPECT_EQ(locked.exitStatus, 0) << locked.output;
   EXPECT_EQ(fact(locked.output, "existed"), "no");
+  EXPECT_EQ(daemon.stop(), 0);
+}
+
+// Commands 8, 22, 9 and 23 on one container: a repair puts back what was
+// removed, a new directory UUID moves it where lookups then find it, and its
+// usage counts a hard-linked file once, before and after the move.
+TEST_F(ContainerEndToEndTest, RepairMoveAndMeasureAContainer) {
+  testing::DaemonProcess daemon(scratch.path());
+  ASSERT_TRUE(daemon.ready());
+  const std::vector<std::string> container = {
+      "--class", "2", "--user", "501", "--identifier", "com.example.app"};
+  const auto run = [&](const std::string& subcommand, bool json = false) {
+    std::vector<std::string> arguments;
+    if (json) arguments.push_back("--json");
+    arguments.push_back(subcommand);
+    arguments.insert(arguments.end(), container.begin(), container.end());
+    return ctl("allowed-client", arguments);
+  };
+  auto made = run("create");
+  ASSERT_EQ(made.exitStatus, 0) << made.output;
+  const std::string path = fact(made.output, "path");
+  const std::string uuid = fact(made.output, "uuid");
+
+  std::ofstream(path + "/Documents/data") << std::string(100000, 'x');
+  fs::create_hard_link(path + "/Documents/data", path + "/tmp/link");
+  struct stat data {
+  }, metadata{};
+  ASSERT_EQ(::stat((path + "/Documents/data").c_str(), &data), 0);
+  ASSERT_EQ(::stat((path + "/.com.zorvane.kestrel.metadata.plist").c_str(), &metadata), 0);
+  const std::string expected = std::to_string((data.st_blocks + metadata.st_blocks) * 512);
+  auto usage = run("usage");
+  ASSERT_EQ(usage.exitStatus, 0) << usage.output;
+  EXPECT_EQ(fact(usage.output, "bytes"), expected);
+  auto json = run("usage", true);
+  EXPECT_NE(json.output.find("\"ReplyDiskUsage\": " + expected), std::string::npos) << json.output;
+
+  struct stat before {};
+  ASSERT_EQ(::stat((path + "/Library/Preferences").c_str(), &before), 0);
+  for (const char* command : {"8", "22"}) {
+    SCOPED_TRACE(command);
+    fs::remove(path + "/Library/Preferences");
+    auto repaired = call("allowed-client", {command, "ContainerClass=u64:2", "UserID=u64:501",
+                                            "Identifier=str:com.example.app", "UUID=uuid:" + uuid});
+    EXPECT_EQ(repaired.exitStatus, 0) << repaired.output;
+    struct stat after {};
+    ASSERT_EQ(::stat((path + "/Library/Preferences").c_str(), &after), 0);
+    EXPECT_EQ(after.st_mode, before.st_mode);
+    EXPECT_EQ(after.st_uid, before.st_uid);
+  }
+
+  auto moved = run("new-uuid");
+  ASSERT_EQ(moved.exitStatus, 0) << moved.output;
+  auto found = run("lookup");
+  ASSERT_EQ(found.exitStatus, 0) << found.output;
+  const std::string newPath = fact(found.output, "path");
+  EXPECT_EQ(fact(found.output, "uuid"), uuid);
+  EXPECT_NE(newPath, path);
+  EXPECT_EQ(fs::path(newPath).parent_path(), fs::path(path).parent_path());
+  EXPECT_FALSE(fs::exists(path));
+  EXPECT_EQ(fs::file_size(newPath + "/tmp/link"), 100000u);
+  EXPECT_EQ(fact(run("usage").output, "bytes"), expected);
   EXPECT_EQ(daemon.stop(), 0);
 }
 

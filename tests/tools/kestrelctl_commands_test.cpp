@@ -131,6 +131,9 @@ TEST(KestrelctlCommandsTest, BuildsTheRequestOfEachSubcommandOrSaysWhatIsMissing
        "Command=u64:21 ContainerClass=u64:2 DataProtectionClass=i64:-3 "
        "Identifier=str:com.example.app IsThirdParty=bool:true RetryIfLocked=bool:false "
        "UserID=u64:501"},
+      {Subcommand::Usage, info,
+       "Command=u64:23 ContainerClass=u64:2 Identifier=str:com.example.app UUID=uuid:" +
+           uuid.string() + " UserID=u64:501"},
       {Subcommand::InfoGet, full, "error: --uuid is required"},
       {Subcommand::SetProtectionClass, full, "error: --protection-class is required"},
   };

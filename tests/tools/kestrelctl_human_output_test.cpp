@@ -120,5 +120,27 @@ TEST(KestrelctlHumanOutputTest, FailuresNameWellKnownCodes) {
   }
 }
 
+TEST(KestrelctlHumanOutputTest, UsageIsShownInBinaryUnitsBesideTheExactBytes) {
+  const struct {
+    std::uint64_t bytes;
+    const char* human;
+  } rows[] = {
+      {0, "0 B"},
+      {1023, "1023 B"},
+      {1024, "1.0 KiB"},
+      {1536, "1.5 KiB"},
+      {1024 * 1024 - 1, "1.0 MiB"},  // not "1024.0 KiB"
+      {std::uint64_t{5} << 30, "5.0 GiB"},
+      {~std::uint64_t{0}, "16.0 EiB"},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.bytes);
+    EXPECT_EQ(humanBytes(row.bytes), row.human);
+  }
+  platform::MessageDictionary reply;
+  reply.setUint64("ReplyDiskUsage", 1536);
+  EXPECT_EQ(renderReply(Subcommand::Usage, reply), "usage  1.5 KiB\nbytes  1536\n");
+}
+
 }  // namespace
 }  // namespace kestrel::kestrelctl

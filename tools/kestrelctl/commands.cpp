@@ -40,6 +40,16 @@ constexpr std::array kSubcommands{
     SubcommandInfo{Subcommand::SetProtectionClass, "set-protection-class", 21,
                    kOptionClass | kOptionUser | kOptionIdentifier | kOptionProtectionClass,
                    "Move a data container's files to another data-protection class"},
+    SubcommandInfo{
+        Subcommand::Repair, "repair", 8,
+        kOptionClass | kOptionUser | kOptionIdentifier | kOptionUUID,
+        "Put back a container's default sub-directories (and a system container's ACLs)"},
+    SubcommandInfo{Subcommand::NewUuid, "new-uuid", 9,
+                   kOptionClass | kOptionUser | kOptionIdentifier | kOptionUUID,
+                   "Move a container to a new directory UUID; its identity stays"},
+    SubcommandInfo{Subcommand::Usage, "usage", 23,
+                   kOptionClass | kOptionUser | kOptionIdentifier | kOptionUUID,
+                   "Show the storage a container's files take"},
 };
 
 // Kept here rather than linking the daemon's logic into the tool; the tests

@@ -27,6 +27,9 @@ enum class Subcommand {
   InfoRemove,
   Metadata,
   SetProtectionClass,
+  Repair,
+  NewUuid,
+  Usage,
 };
 
 // What a subcommand accepts on the command line (bit set).

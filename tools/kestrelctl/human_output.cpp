@@ -242,7 +242,29 @@ std::string renderMetadata(const MessageDictionary& reply) {
   return out;
 }
 
+std::string renderUsage(const MessageDictionary& reply) {
+  const MessageValue* usage = reply.value("ReplyDiskUsage");
+  if (!usage || !usage->uint64()) return renderFacts({{"usage", std::string(kAbsent)}});
+  const std::uint64_t bytes = *usage->uint64();
+  return renderFacts({{"usage", humanBytes(bytes)}, {"bytes", std::to_string(bytes)}});
+}
+
 }  // namespace
+
+std::string humanBytes(std::uint64_t bytes) {
+  static constexpr const char* kUnits[] = {"KiB", "MiB", "GiB", "TiB", "PiB", "EiB"};
+  if (bytes < 1024) return std::to_string(bytes) + " B";
+  double value = static_cast<double>(bytes) / 1024;
+  std::size_t unit = 0;
+  // Rounded to one decimal, 1023.95 KiB shows as 1.0 MiB rather than 1024.0 KiB.
+  while (value >= 1023.95 && unit + 1 < std::size(kUnits)) {
+    value /= 1024;
+    ++unit;
+  }
+  char text[32];
+  std::snprintf(text, sizeof text, "%.1f %s", value, kUnits[unit]);
+  return text;
+}
 
 std::string renderReply(Subcommand subcommand, const MessageDictionary& reply) {
   switch (subcommand) {
@@ -269,6 +291,12 @@ std::string renderReply(Subcommand subcommand, const MessageDictionary& reply) {
       return renderMetadata(reply);
     case Subcommand::SetProtectionClass:
       return "protection class set\n";
+    case Subcommand::Repair:
+      return "default structure recreated\n";
+    case Subcommand::NewUuid:
+      return "container moved to a new directory UUID\n";
+    case Subcommand::Usage:
+      return renderUsage(reply);
   }
   return {};
 }

@@ -15,6 +15,10 @@ namespace kestrel::kestrelctl {
 // key the reply lacks shows as "-".
 std::string renderReply(Subcommand subcommand, const platform::MessageDictionary& reply);
 
+// A byte count for people, in binary units with one decimal: "0 B", "1023 B",
+// "1.5 KiB", "12.0 MiB", ... up to EiB.
+std::string humanBytes(std::uint64_t bytes);
+
 // "not found" for 21, and so on; empty for a code without a name.
 std::string_view errorCodeName(std::uint64_t code);
 
