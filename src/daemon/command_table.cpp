@@ -37,9 +37,9 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {20, KSTHandleInvalidateCodeSigningInfoForAppsWithoutBundleContainer, kKSTEntitlementAllowed,
        1},  // invalidate apps without bundles
       {21, KSTHandleSetDataProtection, kKSTEntitlementAllowed, 0},  // set a container's protection
-      {22, nullptr, kKSTEntitlementAllowed, 1},             // recreate the default structure
-      {23, nullptr, kKSTEntitlementAllowed, 1},             // measure disk usage
-      {24, nullptr, kKSTEntitlementDataMigration, 1},       // the data-migration migration
+      {22, nullptr, kKSTEntitlementAllowed, 1},  // recreate the default structure
+      {23, nullptr, kKSTEntitlementAllowed, 1},  // measure disk usage
+      {24, KSTHandleDataMigration, kKSTEntitlementDataMigration, 1},  // the data migration
       {25, KSTHandleRetryTest, kKSTEntitlementAllowed, 1},  // retry test (internal builds)
       {26, KSTHandleStageSharedContent, kKSTEntitlementStageSharedContent,
        1},  // stage shared content
