@@ -31,23 +31,25 @@ std::uint64_t storedCounter(const KSTMetadataRef& container, std::uint64_t reque
 
 void KSTClientConnection::retryTestForUser(std::uint32_t userId, std::uint64_t withNumCrashes,
                                            std::uint64_t* withError) {
+  const char* const operation = __func__;
   KST_CATCH_EXCEPTIONS(withError, [&] {
     const KSTMetadataRef container =
         createOrLookupContainerForUser(userId, std::string(kRetryTestIdentifier), true,
                                        kKSTContainerClassDataApplication, false, true, withError);
     if (!container) {
-      KSTLog(kLogError, "Failed to create or lookup lookup existing container for retry test: %@",
-             kRetryTestIdentifier);
+      KSTLogTag(kLogError, operation,
+                "Failed to create or lookup lookup existing container for retry test: %@",
+                kRetryTestIdentifier);
       return;
     }
     const std::uint64_t remaining = storedCounter(container, withNumCrashes);
-    KSTLog(kLogError, "Crashes Remaining in retry test: %llu",
-           static_cast<unsigned long long>(remaining));
+    KSTLogTag(kLogError, operation, "Crashes Remaining in retry test: %llu",
+              static_cast<unsigned long long>(remaining));
     setInfoValue(PlistValue(remaining), std::string(kCrashCounterKey), userId, container->uuid(),
                  std::string(kRetryTestIdentifier), kKSTContainerClassDataApplication, true,
                  withError);
     if (remaining != 0) {
-      KSTLog(kLogError, "Crashing");
+      KSTLogTag(kLogError, operation, "Crashing");
       std::this_thread::sleep_for(std::chrono::seconds(2));
       Log::flush();
       platform::exitProcessNow(0);
@@ -56,9 +58,9 @@ void KSTClientConnection::retryTestForUser(std::uint32_t userId, std::uint64_t w
                                       std::vector<std::optional<std::string>>{kRetryTestIdentifier},
                                       {kKSTContainerClassDataApplication}, true, withError);
     if (*withError != kKSTSuccess) {
-      KSTLog(kLogError, "Failed to delete retry container at : %@", container->url());
+      KSTLogTag(kLogError, operation, "Failed to delete retry container at : %@", container->url());
     } else {
-      KSTLog(kLogError, "Returning Successfully");
+      KSTLogTag(kLogError, operation, "Returning Successfully");
     }
   });
 }
