@@ -9,6 +9,7 @@
 
 #include "codesigning/system_container_acls.h"
 #include "migration/container_migrator.h"
+#include "platform/file_system.h"
 #include "platform/uuid.h"
 #include "store/container_cache.h"
 #include "store/global_configuration.h"
@@ -125,6 +126,18 @@ TEST_F(MigrationTest, BackupOfSystemContainersIsRestoredIntoLiveContainers) {
     fs::remove_all(fakes.scratch.resolve(backup));
   }
   EXPECT_FALSE(fakes.logged("Failed", testing::Match::Contains));
+
+  // An entry that cannot be put in place is kept aside, under its container's identifier
+  // (still an internal build, so the backup stays to be looked at).
+  const KSTMetadataRef locked = make(499, 12, "com.zorvane.ternd");
+  fakes.scratch.writeFile(backup + "/Data/com.zorvane.ternd/blocked", "b");
+  ASSERT_EQ(platform::lchflags(locked->url().path().c_str(), platform::kFileFlagUserImmutable), 0);
+  shared.rebootContainerManagerSetup();
+  ASSERT_EQ(platform::lchflags(locked->url().path().c_str(), 0), 0);
+  EXPECT_FALSE(fs::exists(locked->url().path() + "/blocked"));
+  EXPECT_EQ(
+      readAll(fakes.scratch.resolve(backup + "/Data.inprogress.failed/com.zorvane.ternd/blocked")),
+      "b");
 }
 
 TEST_F(MigrationTest, DataMigrationFixesBundleOwnersAndSystemContainerACLsOnce) {
