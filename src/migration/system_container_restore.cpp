@@ -125,9 +125,17 @@ void _moveSystemContainerIntoPlace(const KSTFileURL& restoredDirectory,
       _moveFailedPathAside(entry, failedDirectory, entryName);
     }
   }
-  // The restored content may lack parts of the container's standard
-  // structure; repairing it belongs to structure repair, which this build
-  // does not have yet.
+  // The restored items still carry the owners and modes they had in the
+  // mobile user's backup: they get those of every system container item, so
+  // that the user cannot keep writing into a system container. (Recreating
+  // sub-directories the backup lacked is left to structure repair.)
+  KSTErrorRef standardizeError;
+  if (!files.standardizeACLsForSystemContainerAtURL(destination, &standardizeError)) {
+    std::uint64_t failure = kKSTSuccess;
+    KSTHandOverCode(standardizeError, &failure);
+    KSTLog(kLogError, "Error processing restored system container %@: %llu", name,
+           static_cast<unsigned long long>(failure));
+  }
 }
 
 void _moveFailedPathAside(const KSTFileURL& item, const KSTFileURL& failedDirectory,

@@ -106,6 +106,11 @@ TEST_F(MigrationTest, BackupOfSystemContainersIsRestoredIntoLiveContainers) {
     fs::create_directories(live->url().path() + "/Library/Preferences");
     std::ofstream(live->url().path() + "/Library/Preferences/live.plist") << "live";
     fakes.scratch.writeFile(backup + "/Data/com.zorvane.egretd/Library/restored.plist", "r");
+    ASSERT_EQ(
+        ::chown(fakes.scratch.resolve(backup + "/Data/com.zorvane.egretd/Library/restored.plist")
+                    .c_str(),
+                501, 501),
+        0);
     fakes.scratch.writeFile(backup + "/Data/com.zorvane.egretd/.hidden", "h");
     fakes.scratch.writeFile(backup + "/Shared/systemgroup.com.zorvane.heron.tiles/tile", "t");
 
@@ -113,6 +118,8 @@ TEST_F(MigrationTest, BackupOfSystemContainersIsRestoredIntoLiveContainers) {
     // The restored "Library" replaced the live one; the live metadata stays.
     const std::string system = live->url().path();
     EXPECT_EQ(namesIn(system + "/Library"), Strings{"restored.plist"});
+    // The user who wrote the backup owns nothing in a system container.
+    EXPECT_EQ(testing::ownerOf(system + "/Library/restored.plist"), kKSTSystemContainerItemOwner);
     EXPECT_FALSE(fs::exists(system + "/.hidden"));
     EXPECT_TRUE(fs::exists(system + "/.com.zorvane.kestrel.metadata.plist"));
     const KSTMetadataRef group =
