@@ -56,6 +56,17 @@ inline constexpr const char* kKSTPlaceholderEntitlementsOption =
 // Where a bundle container's info keeps the installer's cached information.
 inline constexpr const char* kKSTCachedCodeSigningInfoKey =
     "com.zorvane.Tessel.CachedCodeSigningInfo";
+// Where a data container's info kept its application groups in older releases.
+inline constexpr const char* kKSTGroupContainerIDsKey = "com.zorvane.Tessel.GroupContainerIDs";
+// The file in the library directory in which older releases kept every
+// identifier's entitlements, and its reserved keys.
+inline constexpr const char* kKSTLegacyEntitlementsFileName = "kst_entitlements.plist";
+inline constexpr const char* kKSTLegacyChildPluginBundleIDsKey =
+    "com.zorvane.Kestrel.ChildPluginBundleIDs";
+inline constexpr const char* kKSTLegacyEntitlementsRegisteredByCallerKey =
+    "com.zorvane.Kestrel.EntitlementsRegisteredByCaller";
+inline constexpr const char* kKSTLegacyPlaceholderEntitlementsKey =
+    "com.zorvane.Kestrel.PlaceholderEntitlements";
 
 using KSTGroupIdentifiers = std::optional<std::vector<std::string>>;
 using KSTGroupIdsBlock =
@@ -127,6 +138,18 @@ class KSTCodeSigningMappingState {
   void iterateGroupIdsWithKey(std::string_view key, std::optional<std::string_view> fallBackKey,
                               const KSTGroupIdsBlock& block);
 
+  // Takeover of older code-signing data (code_signing_migration.cpp), each
+  // until it completes once: the application groups kept in data containers'
+  // info (marker "kst_group_id_migration_complete.plist"), the legacy
+  // entitlements file (done once the file is gone), and the information the
+  // installer cached in bundle containers' info (marker
+  // "kst_code_signing_migration_complete.plist"). They run on the queue with
+  // the lock on all identifiers held for writing, and clear the old copies
+  // without taking container locks. Failures are logged only.
+  void _migrateAppGroupIdsFromDataContainersToFile();
+  void _migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+  void _migrateCachedCodeSigningInfoFromBundleContainersToMapping();
+
   const KSTFileURL& mappingFileURL() const { return url_; }
 
  private:
@@ -150,6 +173,11 @@ class KSTCodeSigningMapping {
   KSTCodeSigningMapping& operator=(const KSTCodeSigningMapping&) = delete;
 
   bool isAvailable() const { return state_ != nullptr && codeSignQueue_ != nullptr; }
+
+  // Command 24's last step: the three migrations above, in order, then the
+  // removal of every application group container that no entry names. Takes
+  // the lock on all identifiers for writing and runs on the queue.
+  void performAllCodeSigningMigrationAndReconciliation();
 
   // Command 19: the information as an external request sees it.
   std::optional<PlistDictionary> getCodeSigningInfoForIdentifier(std::string_view identifier);

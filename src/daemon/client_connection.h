@@ -184,6 +184,13 @@ class KSTClientConnection {
                                    const std::optional<std::string>& identifier,
                                    KSTContainerClass containerClass, std::uint64_t* withError);
 
+  // The retry test (operations/retry_test.cpp): counts down the crashes still
+  // to come, kept in the user's test container "com.zorvane.retryTest", and
+  // ends the process without a reply while any remain; the request that
+  // counts down to zero deletes the container and succeeds.
+  void retryTestForUser(std::uint32_t userId, std::uint64_t withNumCrashes,
+                        std::uint64_t* withError);
+
   // Start-up and boot housekeeping of the container store.
   void rebootContainerManagerSetup();
   void containerManagerSetup();

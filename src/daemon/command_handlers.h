@@ -64,6 +64,9 @@ void KSTHandleSetDataProtection(KSTCommandContext& context);
 // 26: stages shared content inside a system group container.
 void KSTHandleStageSharedContent(KSTCommandContext& context);
 
+// 24: the data-migration migration (migration/data_migration_command.cpp).
+void KSTHandleDataMigration(KSTCommandContext& context);
+
 // 25: the retry test, on internal builds only.
 void KSTHandleRetryTest(KSTCommandContext& context);
 

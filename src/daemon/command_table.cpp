@@ -42,7 +42,7 @@ const std::array<KSTCommandRow, kKSTCommandCount>& KSTCommandTable() {
       {22, KSTHandleRecreateDefaultStructure, kKSTEntitlementAllowed,
        1},                                                  // recreate the default structure
       {23, KSTHandleDiskUsage, kKSTEntitlementAllowed, 1},  // measure disk usage
-      {24, nullptr, kKSTEntitlementDataMigration, 1},       // the data-migration migration
+      {24, KSTHandleDataMigration, kKSTEntitlementDataMigration, 1},  // the data migration
       {25, KSTHandleRetryTest, kKSTEntitlementAllowed, 1},  // retry test (internal builds)
       {26, KSTHandleStageSharedContent, kKSTEntitlementStageSharedContent,
        1},  // stage shared content

@@ -13,14 +13,11 @@ void KSTHandleRetryTest(KSTCommandContext& context) {
               "People really shouldn't be calling this on non-internal installs!");
     return;
   }
-  // Internal builds run the crash-retry operation; the dispatcher does not
-  // offer the command there until that operation exists (KSTCommandIsAvailable).
+  context.client.retryTestForUser(request->userId, request->numRetryCrashes, context.error);
 }
 
 bool KSTCommandIsAvailable(const KSTCommandRow& row) {
-  if (row.handler == nullptr) return false;
-  if (row.index == 25) return !platform::services().deviceInfo->isInternalBuild();
-  return true;
+  return row.handler != nullptr;
 }
 
 }  // namespace kestrel

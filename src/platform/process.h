@@ -19,6 +19,10 @@ std::vector<std::string> currentCallStackSymbols();
 // service manager keeps in its journal) and aborts the process.
 [[noreturn]] void abortWithCrashMessage(std::string_view message);
 
+// Ends the process at once with the status, as if it had been killed: no
+// destructor or exit handler runs, and other threads stop where they are.
+[[noreturn]] void exitProcessNow(int status);
+
 }  // namespace kestrel::platform
 
 namespace kestrel::platform {

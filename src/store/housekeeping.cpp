@@ -2,15 +2,18 @@
 // these on the shared client connection, on the main thread, before the
 // listener opens: every start finishes what the last run left half-done
 // (journalled replaces, containers half-built in staging); the first start
-// after boot also throws away every transient container and retires what
-// does not belong in a class directory. Nothing is destroyed here: what goes
-// is moved to death row, and the sweep started last destroys it.
+// after boot also moves what older releases left in old places, restores
+// system containers from a device backup, throws away every transient
+// container and retires what does not belong in a class directory. Nothing is destroyed here: what
+// goes is moved to death row, and the sweep started last destroys it.
 #include <cerrno>
 
 #include "codesigning/whitelist.h"
 #include "daemon/client_connection.h"
 #include "daemon/daemon_state.h"
 #include "daemon/log.h"
+#include "migration/container_migrator.h"
+#include "migration/system_container_restore.h"
 #include "platform/crash_point.h"
 #include "platform/services.h"
 #include "platform/uuid.h"
@@ -21,8 +24,12 @@
 namespace kestrel {
 
 void KSTClientConnection::rebootContainerManagerSetup() {
-  // The start-up migrations and the restore of system containers from their
-  // backup belong here; this build has neither.
+  KSTErrorRef error;
+  if (!KSTContainerMigrator::sharedInstance().performSynchronousDaemonStartupMigrationWithError(
+          &error)) {
+    KSTLog(kLogError, "Failed to perform daemon startup migration : %@", error);
+  }
+  KSTMoveSystemContainersIntoPlace(*this);
 }
 
 void KSTClientConnection::containerManagerSetup() {

@@ -114,6 +114,15 @@ int DaemonProcess::stop() {
   return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
 }
 
+int DaemonProcess::waitForExit() {
+  if (pid_ <= 0) return -1;
+  int status = 0;
+  ::waitpid(pid_, &status, 0);
+  pid_ = -1;
+  daemonPid_ = -1;
+  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+}
+
 ProcessResult runProcess(const std::string& program, const std::vector<std::string>& arguments,
                          const std::vector<std::string>& extraEnvironment) {
   ProcessResult result;

@@ -27,6 +27,8 @@ class DaemonProcess {
   bool ready() const { return ready_; }
   // Sends SIGTERM and returns the exit status (or -1).
   int stop();
+  // Waits until the daemon ends by itself; its exit status (or -1).
+  int waitForExit();
 
  private:
   pid_t pid_ = -1;  // the process started: the daemon or its wrapper

@@ -32,6 +32,10 @@ std::vector<std::string> currentCallStackSymbols() {
   return result;
 }
 
+void exitProcessNow(int status) {
+  ::_exit(status);
+}
+
 void abortWithCrashMessage(std::string_view message) {
   // write(2) rather than stdio: the process may be in any state.
   std::string text(message);
