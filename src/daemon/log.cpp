@@ -29,6 +29,13 @@ std::shared_ptr<platform::LogHandle> currentHandle() {
 
 }  // namespace
 
+struct LogThresholdUpdate {
+  static void apply() {
+    Log::enabledThreshold_.store(state().hasHandle ? state().level.load() : INT_MAX,
+                                 std::memory_order_relaxed);
+  }
+};
+
 bool Log::open(const std::string& subsystem, const std::string& path, int level) {
   const auto& logging = platform::services().logging;
   std::shared_ptr<platform::LogHandle> handle = logging ? logging->open(subsystem, path) : nullptr;
@@ -36,6 +43,7 @@ bool Log::open(const std::string& subsystem, const std::string& path, int level)
   state().handle = handle;
   state().hasHandle = handle != nullptr;
   state().level = level;
+  LogThresholdUpdate::apply();
   return handle != nullptr;
 }
 
@@ -52,11 +60,9 @@ int Log::currentLevel() {
   return state().level;
 }
 void Log::setCurrentLevel(int level) {
+  std::lock_guard lock(state().mutex);
   state().level = level;
-}
-
-bool Log::isEnabled(int level) {
-  return !state().hasHandle || state().level >= level;
+  LogThresholdUpdate::apply();
 }
 
 void Log::write(int level, std::string_view tag, std::string_view message) {
@@ -66,7 +72,8 @@ void Log::write(int level, std::string_view tag, std::string_view message) {
   std::string shortened;
   if (message.size() > Log::kMaxLogMessageBytes) {
     shortened.assign(message.substr(0, Log::kMaxLogMessageBytes));
-    shortened += " ... (" + std::to_string(message.size() - Log::kMaxLogMessageBytes) + " bytes more)";
+    shortened +=
+        " ... (" + std::to_string(message.size() - Log::kMaxLogMessageBytes) + " bytes more)";
     message = shortened;
   }
   if (auto handle = currentHandle()) {
@@ -87,6 +94,7 @@ void Log::close() {
   state().handle.reset();
   state().hasHandle = false;
   state().level = kDefaultLevel;
+  LogThresholdUpdate::apply();
 }
 
 }  // namespace kestrel

@@ -7,6 +7,8 @@
 //   KSTLogTag(kLogNotice, "main", "kestreld first boot cleanup complete");
 #pragma once
 
+#include <atomic>
+#include <climits>
 #include <memory>
 #include <string>
 #include <string_view>
@@ -36,11 +38,21 @@ class Log {
   static bool hasHandle();
   static int currentLevel();
   static void setCurrentLevel(int level);
-  static bool isEnabled(int level);
+  // Inline and lock-free: debug lines on hot paths (the identifier locks) cost
+  // one relaxed load when they are not written.
+  static bool isEnabled(int level) {
+    return level <= enabledThreshold_.load(std::memory_order_relaxed);
+  }
   static void write(int level, std::string_view tag, std::string_view message);
   static void flush();
   // Drops the handle (tests start from a closed log).
   static void close();
+
+ private:
+  // The highest level written: the current level with a handle, every level
+  // without one. Kept beside the state it is made of, under its mutex.
+  static inline constinit std::atomic<int> enabledThreshold_{INT_MAX};
+  friend struct LogThresholdUpdate;
 };
 
 template <typename... Args>
