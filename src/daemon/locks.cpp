@@ -4,14 +4,19 @@
 
 #include <algorithm>
 #include <atomic>
+#include <bit>
+#include <cerrno>
+#include <chrono>
 #include <condition_variable>
 #include <cstdint>
-#include <map>
+#include <cstring>
 #include <memory>
 #include <mutex>
 #include <set>
 #include <string_view>
+#include <thread>
 #include <utility>
+#include <vector>
 
 #include "daemon/invariant.h"
 #include "daemon/log.h"
@@ -40,17 +45,25 @@ class ReaderWriterLock {
     const int status = pthread_rwlock_rdlock(&lock_);
     KST_INVARIANT(status == 0);
   }
+  bool tryLockForWriting() { return tryStatus(pthread_rwlock_trywrlock(&lock_)); }
+  bool tryLockForReading() { return tryStatus(pthread_rwlock_tryrdlock(&lock_)); }
   void unlock() {
     const int status = pthread_rwlock_unlock(&lock_);
     KST_INVARIANT(status == 0);
   }
 
  private:
+  static bool tryStatus(int status) {
+    KST_INVARIANT(status == 0 || status == EBUSY || status == EAGAIN);
+    return status == 0;
+  }
   pthread_rwlock_t lock_;
 };
 
-// One identifier that is locked or waited for. Made when the first locker
-// arrives and destroyed when the last one releases it.
+// One identifier that is locked or waited for. Taken from the table's spares
+// when the first locker arrives and given back when the last one releases it,
+// so that the lock and unlock of an identifier nobody else holds allocate
+// nothing.
 struct KSTIdentifierLock {
   ReaderWriterLock lock;
   // Holders and waiters of this record; guarded by gKSTLocks.mutex.
@@ -58,21 +71,150 @@ struct KSTIdentifierLock {
   // 0 free, -1 held by a writer, n > 0 held by n readers. Changed only by atomic
   // operations with full barriers, by the holders of `lock`.
   std::atomic<std::int32_t> lockState{0};
+  // The table's part, guarded by gKSTLocks.mutex: the key, its hash and the
+  // next record of the same bucket.
+  std::string identifier;
+  std::size_t hash = 0;
+  std::unique_ptr<KSTIdentifierLock> next;
 };
 
-using KSTIdentifierLockMap = std::map<std::string, std::unique_ptr<KSTIdentifierLock>, std::less<>>;
+// Identifier -> record: a chained hash table whose records keep their key's
+// storage when they go back to the spares. Guarded by gKSTLocks.mutex.
+class KSTIdentifierLockTable {
+ public:
+  // Eight bytes at a time, each word multiplied on its own and the products
+  // summed, so the multiplications overlap: a UUID's text costs a few
+  // nanoseconds (the library's byte-wise hash cost more than the rest of a lock
+  // and unlock together).
+  static std::size_t hashOf(std::string_view identifier) {
+    constexpr std::uint64_t kOdd = 0x9E3779B97F4A7C15ull;
+    constexpr std::uint64_t kEven = 0xBF58476D1CE4E5B9ull;
+    const char* bytes = identifier.data();
+    std::size_t left = identifier.size();
+    std::uint64_t odd = identifier.size();
+    std::uint64_t even = 0;
+    for (; left >= 16; bytes += 16, left -= 16) {
+      std::uint64_t first;
+      std::uint64_t second;
+      std::memcpy(&first, bytes, 8);
+      std::memcpy(&second, bytes + 8, 8);
+      odd = std::rotl(odd, 23) + first * kOdd;
+      even = std::rotl(even, 29) + second * kEven;
+    }
+    if (left >= 8) {
+      std::uint64_t word;
+      std::memcpy(&word, bytes, 8);
+      odd += word * kEven;
+      bytes += 8;
+      left -= 8;
+    }
+    if (left > 0) {
+      // The last eight bytes of the text when it has that many (overlapping
+      // bytes already taken), else the bytes gathered in a register: a short
+      // copy through memory would stall the load that follows it.
+      std::uint64_t word = 0;
+      if (identifier.size() >= 8) {
+        std::memcpy(&word, identifier.data() + identifier.size() - 8, 8);
+      } else {
+        for (std::size_t i = 0; i < left; ++i) {
+          word |= static_cast<std::uint64_t>(static_cast<unsigned char>(bytes[i])) << (8 * i);
+        }
+      }
+      even += word * kOdd;
+    }
+    std::uint64_t hash = (odd ^ std::rotl(even, 32)) * kOdd;
+    return static_cast<std::size_t>(hash ^ (hash >> 32));
+  }
 
-// The process-wide lock state. `mutex` guards every other field and the map.
+  KSTIdentifierLock* find(std::string_view identifier, std::size_t hash) const {
+    if (buckets_.empty()) return nullptr;
+    for (KSTIdentifierLock* record = buckets_[hash & (buckets_.size() - 1)].get();
+         record != nullptr; record = record->next.get()) {
+      if (record->hash == hash && record->identifier == identifier) return record;
+    }
+    return nullptr;
+  }
+
+  KSTIdentifierLock& findOrInsert(std::string_view identifier, std::size_t hash) {
+    if (KSTIdentifierLock* found = find(identifier, hash)) return *found;
+    if (size_ + 1 > buckets_.size()) grow();
+    std::unique_ptr<KSTIdentifierLock> record;
+    if (spares_.empty()) {
+      record = std::make_unique<KSTIdentifierLock>();
+    } else {
+      record = std::move(spares_.back());
+      spares_.pop_back();
+    }
+    record->identifier.assign(identifier);
+    record->hash = hash;
+    auto& head = buckets_[hash & (buckets_.size() - 1)];
+    record->next = std::move(head);
+    head = std::move(record);
+    ++size_;
+    return *head;
+  }
+
+  // Takes the record out of the table; it must be free and unused.
+  void erase(const KSTIdentifierLock& record) {
+    std::unique_ptr<KSTIdentifierLock>* link = &buckets_[record.hash & (buckets_.size() - 1)];
+    while (link->get() != &record) link = &(*link)->next;
+    std::unique_ptr<KSTIdentifierLock> removed = std::move(*link);
+    *link = std::move(removed->next);
+    --size_;
+    if (spares_.size() < kMaxSpares) spares_.push_back(std::move(removed));
+  }
+
+  std::size_t size() const { return size_; }
+
+ private:
+  // Enough for every request thread to hold a few identifiers at once.
+  static constexpr std::size_t kMaxSpares = 256;
+  static constexpr std::size_t kInitialBuckets = 64;
+
+  void grow() {
+    std::vector<std::unique_ptr<KSTIdentifierLock>> old = std::move(buckets_);
+    buckets_.clear();
+    buckets_.resize(old.empty() ? kInitialBuckets : old.size() * 2);
+    for (auto& head : old) {
+      while (head) {
+        std::unique_ptr<KSTIdentifierLock> record = std::move(head);
+        head = std::move(record->next);
+        auto& slot = buckets_[record->hash & (buckets_.size() - 1)];
+        record->next = std::move(slot);
+        slot = std::move(record);
+      }
+    }
+  }
+
+  std::vector<std::unique_ptr<KSTIdentifierLock>> buckets_;  // a power of two long
+  std::vector<std::unique_ptr<KSTIdentifierLock>> spares_;
+  std::size_t size_ = 0;
+};
+
+// A condition variable that counts its sleepers (under gKSTLocks.mutex), so
+// that signalling nobody costs nothing.
+struct KSTLockCondition {
+  std::condition_variable variable;
+  std::uint32_t sleepers = 0;
+
+  void notify_one() {
+    if (sleepers != 0) variable.notify_one();
+  }
+  void notify_all() {
+    if (sleepers != 0) variable.notify_all();
+  }
+};
+
+// The process-wide lock state. `mutex` guards every other field and the table.
 // It is always taken alone: a record's lock is awaited only after `mutex` has
 // been released, and released while `mutex` is held.
 struct KSTLocksState {
   std::mutex mutex;
-  std::condition_variable allWritersCondition;
-  std::condition_variable allReadersCondition;
-  std::condition_variable identifierWritersCondition;
-  std::condition_variable identifierReadersCondition;
-  // Made on first use.
-  std::unique_ptr<KSTIdentifierLockMap> identifierToLockMap;
+  KSTLockCondition allWritersCondition;
+  KSTLockCondition allReadersCondition;
+  KSTLockCondition identifierWritersCondition;
+  KSTLockCondition identifierReadersCondition;
+  KSTIdentifierLockTable identifierToLockMap;
   // Identifier locks held or being acquired. Raised before the record's lock is
   // taken, so that a writer of all identifiers also waits for lockers still
   // blocked on a record.
@@ -83,6 +225,56 @@ struct KSTLocksState {
 };
 
 KSTLocksState gKSTLocks;
+
+// Every lock here is held for a short while by requests that run on other
+// cores, and a thread put to sleep on this virtual machine takes tens of
+// microseconds to wake: so a locker that finds a lock taken tries again for a
+// few microseconds before it sleeps.
+constexpr auto kSpinBeforeSleeping = std::chrono::microseconds(20);
+
+void cpuRelax() {
+#if defined(__x86_64__) || defined(__i386__)
+  __builtin_ia32_pause();
+#else
+  std::this_thread::yield();
+#endif
+}
+
+// Calls `attempt` until it succeeds or the spin time is over.
+template <typename Attempt>
+bool spinFor(Attempt attempt) {
+  if (attempt()) return true;
+  const auto deadline = std::chrono::steady_clock::now() + kSpinBeforeSleeping;
+  do {
+    for (int i = 0; i < 32; ++i) cpuRelax();
+    if (attempt()) return true;
+  } while (std::chrono::steady_clock::now() < deadline);
+  return false;
+}
+
+std::unique_lock<std::mutex> lockStateMutex() {
+  std::unique_lock lock(gKSTLocks.mutex, std::defer_lock);
+  if (!spinFor([&] { return lock.try_lock(); })) lock.lock();
+  return lock;
+}
+
+// Returns with `lock` held and `ready()` true: tries for a while with the
+// mutex released between tries, then sleeps on the condition.
+template <typename Ready>
+void waitUntil(std::unique_lock<std::mutex>& lock, KSTLockCondition& condition, Ready ready) {
+  if (ready()) return;
+  lock.unlock();
+  spinFor([&] {
+    if (!lock.try_lock()) return false;
+    if (ready()) return true;
+    lock.unlock();
+    return false;
+  });
+  if (!lock.owns_lock()) lock.lock();
+  ++condition.sleepers;
+  condition.variable.wait(lock, ready);
+  --condition.sleepers;
+}
 
 const char* modeName(bool forWriting) {
   return forWriting ? "writing" : "reading";
@@ -122,47 +314,42 @@ std::vector<std::string> sortedIdentifiers(const PlistArray& identifiers, bool a
 }
 
 void take_one_lock(const std::string& identifier, bool forWriting) {
+  const std::size_t hash = KSTIdentifierLockTable::hashOf(identifier);
   KSTIdentifierLock* record = nullptr;
   {
-    std::unique_lock lock(gKSTLocks.mutex);
+    std::unique_lock lock = lockStateMutex();
     if (forWriting) {
-      gKSTLocks.identifierWritersCondition.wait(lock,
-                                                [] { return gKSTLocks.allReaderWriterState == 0; });
+      waitUntil(lock, gKSTLocks.identifierWritersCondition,
+                [] { return gKSTLocks.allReaderWriterState == 0; });
       ++gKSTLocks.identifierWriterCount;
     } else {
-      gKSTLocks.identifierReadersCondition.wait(
-          lock, [] { return gKSTLocks.allReaderWriterState != -1; });
+      waitUntil(lock, gKSTLocks.identifierReadersCondition,
+                [] { return gKSTLocks.allReaderWriterState != -1; });
       ++gKSTLocks.identifierReaderCount;
     }
-
-    if (!gKSTLocks.identifierToLockMap) {
-      gKSTLocks.identifierToLockMap = std::make_unique<KSTIdentifierLockMap>();
-    }
-    auto& slot = (*gKSTLocks.identifierToLockMap)[identifier];
-    if (!slot) slot = std::make_unique<KSTIdentifierLock>();
-    ++slot->useCount;
-    record = slot.get();
+    record = &gKSTLocks.identifierToLockMap.findOrInsert(identifier, hash);
+    ++record->useCount;
   }
 
   KSTLog(kLogDebug, "Waiting to lock %@ for %s", identifier, modeName(forWriting));
   if (forWriting) {
-    record->lock.lockForWriting();
+    if (!spinFor([&] { return record->lock.tryLockForWriting(); })) record->lock.lockForWriting();
     std::int32_t expected = 0;
     KST_INVARIANT(record->lockState.compare_exchange_strong(expected, -1));
   } else {
-    record->lock.lockForReading();
+    if (!spinFor([&] { return record->lock.tryLockForReading(); })) record->lock.lockForReading();
     KST_INVARIANT(record->lockState.fetch_add(1) + 1 > 0);
   }
   KSTLog(kLogDebug, "Got lock on identifier %@", identifier);
 }
 
 void unlock_one_lock(const std::string& identifier) {
-  std::lock_guard lock(gKSTLocks.mutex);
-  KST_INVARIANT(gKSTLocks.identifierToLockMap != nullptr);
-  KSTIdentifierLockMap& map = *gKSTLocks.identifierToLockMap;
-  const auto found = map.find(identifier);
-  KST_INVARIANT(found != map.end());
-  KSTIdentifierLock& record = *found->second;
+  const std::size_t hash = KSTIdentifierLockTable::hashOf(identifier);
+  std::unique_lock lock = lockStateMutex();
+  KSTIdentifierLockTable& map = gKSTLocks.identifierToLockMap;
+  KSTIdentifierLock* found = map.find(identifier, hash);
+  KST_INVARIANT(found != nullptr);
+  KSTIdentifierLock& record = *found;
   KST_INVARIANT(record.lockState.load() != 0);
 
   if (record.lockState.load() == -1) {
@@ -196,7 +383,7 @@ void unlock_one_lock(const std::string& identifier) {
   if (record.useCount == 0) {
     KSTLog(kLogDebug, "Destroying lock for identifier %@", identifier);
     KST_INVARIANT(record.lockState.load() == 0);
-    map.erase(found);
+    map.erase(record);
   }
 }
 
@@ -260,15 +447,15 @@ void unlock_identifier(const std::vector<std::string>& identifiers) {
 
 void _lock_all_identifiers(bool forWriting) {
   KSTLog(kLogDebug, "Waiting to lock all identifiers for %s", modeName(forWriting));
-  std::unique_lock lock(gKSTLocks.mutex);
+  std::unique_lock lock = lockStateMutex();
   if (forWriting) {
-    gKSTLocks.allWritersCondition.wait(lock, [] {
+    waitUntil(lock, gKSTLocks.allWritersCondition, [] {
       return gKSTLocks.identifierReaderCount == 0 && gKSTLocks.identifierWriterCount == 0 &&
              gKSTLocks.allReaderWriterState == 0;
     });
     gKSTLocks.allReaderWriterState = -1;
   } else {
-    gKSTLocks.allReadersCondition.wait(lock, [] {
+    waitUntil(lock, gKSTLocks.allReadersCondition, [] {
       return gKSTLocks.identifierWriterCount == 0 && gKSTLocks.allReaderWriterState != -1;
     });
     ++gKSTLocks.allReaderWriterState;
@@ -278,7 +465,7 @@ void _lock_all_identifiers(bool forWriting) {
 
 void unlock_all_identifiers() {
   {
-    std::lock_guard lock(gKSTLocks.mutex);
+    std::unique_lock lock = lockStateMutex();
     if (gKSTLocks.allReaderWriterState == -1) {
       gKSTLocks.allReaderWriterState = 0;
       gKSTLocks.allWritersCondition.notify_one();
@@ -300,7 +487,7 @@ void unlock_all_identifiers() {
 
 std::size_t KSTLocksLiveRecordCount() {
   std::lock_guard lock(gKSTLocks.mutex);
-  return gKSTLocks.identifierToLockMap ? gKSTLocks.identifierToLockMap->size() : 0;
+  return gKSTLocks.identifierToLockMap.size();
 }
 
 // ---- Guards

@@ -333,14 +333,14 @@ TEST_F(LocksDeathTest, MisuseAbortsWithTheFailedCondition) {
     const char* message;
   } rows[] = {
       {"identifier never locked in this process", [] { unlock_identifier("X"); },
-       "identifierToLockMap != nullptr"},
+       "found != nullptr"},
       {"identifier released twice",
        [] {
          _lock_identifier("X", kKSTLockForWriting);
          unlock_identifier("X");
          unlock_identifier(std::vector<std::string>{"X"});
        },
-       "found != map.end\\(\\)"},
+       "found != nullptr"},
       {"all identifiers not locked", [] { unlock_all_identifiers(); }, "allReaderWriterState > 0"},
       {"number as identifier", [] { _lock_identifier(PlistValue(42), kKSTLockForReading); },
        "Unknown parameter type!"},
