@@ -83,7 +83,7 @@ int lchflags(const char* path, std::uint32_t flags);
 // --- Whole files ---------------------------------------------------------------------------
 
 // Reads the whole regular file at path (not through a symbolic link: ELOOP),
-// and drops it from the page cache afterwards. EFBIG when it holds more than
+// uncached: its pages are the first the kernel reclaims. EFBIG when it holds more than
 // maxSize bytes, EISDIR or EINVAL when it is not a regular file.
 int readWholeFile(const char* path, std::size_t maxSize, std::vector<std::uint8_t>* contents);
 

@@ -2,12 +2,13 @@
 
 #include <acl/libacl.h>
 #include <attr/libattr.h>
+#include <dirent.h>
 #include <fcntl.h>
 #include <fts.h>
 #include <linux/fs.h>
-#include <sys/syscall.h>
 #include <sys/ioctl.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -15,6 +16,7 @@
 #include <cstring>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -92,6 +94,152 @@ int removeTree(const char* path, const TreeRemoveErrorCallback& onItemError, lon
 }
 
 constexpr int kArrivalRetries = 4;
+
+// Beyond this many directories deep, the removal goes on by paths (above), so
+// that a pathological tree cannot exhaust the descriptors.
+constexpr int kMaxDescriptorDepth = 128;
+
+// Removes a tree relative to open directories, as `rm -rf` does: entries are
+// listed with getdents64 and their type taken from it (no stat per file),
+// files are unlinked by name in their open directory, and directories are
+// opened without following links, checked to be on the tree's file system
+// and emptied before they go. The same outcome as the walk above, item for
+// item: the same errors reported, links never followed, other file systems
+// not entered, arrivals during the removal removed too.
+class DescriptorTreeRemover {
+ public:
+  DescriptorTreeRemover(const TreeRemoveErrorCallback& onItemError, long& failures)
+      : onItemError_(onItemError), failures_(failures) {}
+
+  // Removes the directory `path` (lstat'ed as `info`) with its contents.
+  int removeTop(const char* path, const struct stat& info) {
+    device_ = info.st_dev;
+    path_ = path;
+    return removeDirectory(AT_FDCWD, path, 0, true);
+  }
+
+ private:
+  // Counts a failed item and asks the callback: 0 to go on, else the error to stop with.
+  int report(int error) {
+    ++failures_;
+    return onItemError_ && onItemError_(path_.c_str(), error) ? 0 : error;
+  }
+
+  // Appends "/name" to path_ for the life of the object.
+  class PathPart {
+   public:
+    PathPart(std::string& path, const char* name, bool top) : path_(path), mark_(path.size()) {
+      if (!top) (path_ += '/') += name;
+    }
+    ~PathPart() { path_.resize(mark_); }
+    PathPart(const PathPart&) = delete;
+    PathPart& operator=(const PathPart&) = delete;
+
+   private:
+    std::string& path_;
+    std::size_t mark_;
+  };
+
+  int removeDirectory(int parent, const char* name, int depth, bool top = false) {
+    PathPart part(path_, name, top);
+    if (depth > kMaxDescriptorDepth) {
+      const int error = removeTree(path_.c_str(), onItemError_, failures_, kArrivalRetries);
+      return error == ENOENT ? 0 : error;
+    }
+    const UniqueFd directory(
+        ::openat(parent, name, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!directory) {
+      const int openError = errno;
+      if (openError == ENOENT) return 0;
+      if (openError == ENOTDIR || openError == ELOOP) return removeFile(parent, name, true);
+      // Its contents cannot be listed: it goes only when it is empty.
+      if (::unlinkat(parent, name, AT_REMOVEDIR) == 0) return 0;
+      return report(openError);
+    }
+    struct stat info {};
+    if (::fstat(directory.get(), &info) != 0) return report(errno);
+    // A file system mounted here is not entered; its mount point stays.
+    const bool enter = info.st_dev == device_;
+    const long failuresBefore = failures_;
+    for (int retries = kArrivalRetries;; --retries) {
+      if (enter) {
+        if (const int error = removeContents(directory.get(), depth); error != 0) return error;
+      }
+      if (::unlinkat(parent, name, AT_REMOVEDIR) == 0 || errno == ENOENT) return 0;
+      const int error = errno;
+      // Emptied without a failure and still not empty: entries arrived meanwhile.
+      if (error == ENOTEMPTY && enter && failures_ == failuresBefore && retries > 0 &&
+          ::lseek(directory.get(), 0, SEEK_SET) == 0) {
+        continue;
+      }
+      return report(error);
+    }
+  }
+
+  // `named`: path_ names the item already.
+  int removeFile(int parent, const char* name, bool named = false) {
+    std::optional<PathPart> part;
+    if (!named) part.emplace(path_, name, false);
+    if (::unlinkat(parent, name, 0) == 0 || errno == ENOENT) return 0;
+    return report(errno);
+  }
+
+  int removeContents(int directory, int depth) {
+    // The buffer's own storage: deeper levels may grow buffers_, which moves
+    // the vectors but not what they hold.
+    char* const buffer = bufferAt(depth).data();
+    for (;;) {
+      const long length = ::syscall(SYS_getdents64, directory, buffer, kListingBytes);
+      if (length == 0) return 0;
+      if (length < 0) {
+        if (errno == EINTR) continue;
+        return report(errno);
+      }
+      // Each record: inode (8 bytes), offset (8), record length (2), type (1), name.
+      for (long offset = 0; offset < length;) {
+        const char* record = buffer + offset;
+        unsigned short recordLength = 0;
+        std::memcpy(&recordLength, record + 16, sizeof recordLength);
+        offset += recordLength;
+        const auto type = static_cast<unsigned char>(record[18]);
+        const char* name = record + 19;
+        if (name[0] == '.' && (name[1] == '\0' || (name[1] == '.' && name[2] == '\0'))) continue;
+        if (const int error = removeEntry(directory, name, type, depth); error != 0) return error;
+      }
+    }
+  }
+
+  int removeEntry(int directory, const char* name, unsigned char type, int depth) {
+    if (type == DT_UNKNOWN) {
+      struct stat info {};
+      if (::fstatat(directory, name, &info, AT_SYMLINK_NOFOLLOW) != 0) {
+        if (errno == ENOENT) return 0;
+        PathPart part(path_, name, false);
+        return report(errno);
+      }
+      type = S_ISDIR(info.st_mode) ? DT_DIR : DT_REG;
+    }
+    if (type != DT_DIR) {
+      if (::unlinkat(directory, name, 0) == 0 || errno == ENOENT) return 0;
+      // Replaced by a directory since it was listed.
+      if (errno != EISDIR && errno != EPERM) return removeFile(directory, name);
+    }
+    return removeDirectory(directory, name, depth + 1);
+  }
+
+  std::vector<char>& bufferAt(int depth) {
+    while (buffers_.size() <= static_cast<std::size_t>(depth)) buffers_.emplace_back(kListingBytes);
+    return buffers_[static_cast<std::size_t>(depth)];
+  }
+
+  static constexpr std::size_t kListingBytes = 32 * 1024;
+
+  const TreeRemoveErrorCallback& onItemError_;
+  long& failures_;
+  dev_t device_ = 0;
+  std::string path_;
+  std::vector<std::vector<char>> buffers_;
+};
 
 // --- Copy ----------------------------------------------------------------------------------
 
@@ -399,7 +547,12 @@ int writeAtomically(const char* path, std::span<const std::uint8_t> contents,
 
 int treeRemove(const char* path, const TreeRemoveErrorCallback& onItemError) {
   long failures = 0;
-  return removeTree(path, onItemError, failures, kArrivalRetries);
+  struct stat info {};
+  if (::lstat(path, &info) != 0) return errno;
+  if (!S_ISDIR(info.st_mode)) return removeTree(path, onItemError, failures, kArrivalRetries);
+  DescriptorTreeRemover remover(onItemError, failures);
+  const int error = remover.removeTop(path, info);
+  return error == ENOENT ? 0 : error;
 }
 
 int makePath(const char* path, mode_t mode) {
@@ -467,6 +620,11 @@ int readWholeFile(const char* path, std::size_t maxSize, std::vector<std::uint8_
   if (!S_ISREG(st.st_mode)) return EINVAL;
   if (static_cast<std::uint64_t>(st.st_size) > maxSize) return EFBIG;
   contents->reserve(static_cast<std::size_t>(st.st_size));
+  // Uncached: the pages are read once, so they go to the end of the kernel's
+  // reclaim order instead of pushing other files' pages out. They are not
+  // dropped after the read: a cache rebuild that follows a restart would then
+  // read every metadata file from the disk again.
+  ::posix_fadvise(fd.get(), 0, 0, POSIX_FADV_NOREUSE);
   std::uint8_t buffer[1 << 14];
   for (;;) {
     const ssize_t n = ::read(fd.get(), buffer, sizeof buffer);
@@ -483,7 +641,6 @@ int readWholeFile(const char* path, std::size_t maxSize, std::vector<std::uint8_
     }
     contents->insert(contents->end(), buffer, buffer + n);
   }
-  ::posix_fadvise(fd.get(), 0, 0, POSIX_FADV_DONTNEED);
   return 0;
 }
 
