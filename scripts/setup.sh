@@ -3,7 +3,7 @@
 # Idempotent and quiet when everything is present already.
 set -euo pipefail
 packages=(
-  cmake ninja-build g++ pkg-config
+  cmake ninja-build g++ pkg-config ccache
   libsystemd-dev libplist-dev libspdlog-dev libfmt-dev libacl1-dev libattr1-dev uuid-dev
   libcli11-dev nlohmann-json3-dev scdoc
   googletest libgtest-dev libgmock-dev libbenchmark-dev
