@@ -39,9 +39,18 @@ void DaemonConnection::ping() {
 
 std::uint64_t DaemonConnection::request(const platform::MessageDictionary& request,
                                         platform::MessageDictionary* reply) {
+  return call(platform::kMessageRequestMethod, request, reply);
+}
+
+std::uint64_t DaemonConnection::floor(const platform::MessageDictionary& request) {
+  return call("Floor", request, nullptr);
+}
+
+std::uint64_t DaemonConnection::call(const char* method, const platform::MessageDictionary& request,
+                                     platform::MessageDictionary* reply) {
   sd_bus_message* call = nullptr;
-  int r = sd_bus_message_new_method_call(bus_.get(), &call, kService, path_.c_str(), kService,
-                                         platform::kMessageRequestMethod);
+  int r =
+      sd_bus_message_new_method_call(bus_.get(), &call, kService, path_.c_str(), kService, method);
   MessageRef callOwner(call);
   if (r >= 0) r = platform::dbus::appendDictionary(call, request);
   sd_bus_message* rawReply = nullptr;

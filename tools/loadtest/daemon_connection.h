@@ -23,8 +23,14 @@ class DaemonConnection {
   // goes to *reply when given.
   std::uint64_t request(const platform::MessageDictionary& request,
                         platform::MessageDictionary* reply = nullptr);
+  // The same request to the "Floor" method of a daemon built with the
+  // benchmarks: decoded and answered with a reply of the same shape, no work.
+  std::uint64_t floor(const platform::MessageDictionary& request);
 
  private:
+  std::uint64_t call(const char* method, const platform::MessageDictionary& request,
+                     platform::MessageDictionary* reply);
+
   struct BusUnref {
     void operator()(sd_bus* bus) const { sd_bus_flush_close_unref(bus); }
   };
