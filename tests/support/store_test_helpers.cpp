@@ -89,6 +89,14 @@ KSTMetadataRef writeContainer(std::uint32_t user, KSTContainerClass containerCla
   return record;
 }
 
+std::optional<PlistDictionary> infoOnDisk(const KSTMetadataRef& container) {
+  KSTErrorRef error;
+  auto read =
+      KSTMetadata::readAndValidateMetadataAtUrl(container->url(), container->uid(), true, &error);
+  EXPECT_TRUE(read) << messageOf(error);
+  return read ? read->info() : std::nullopt;
+}
+
 KSTMetadataRef existingContainer(std::uint32_t user, KSTContainerClass containerClass,
                                  const std::string& identifier) {
   KSTErrorRef error;

@@ -58,6 +58,9 @@ KSTMetadataRef writeContainer(std::uint32_t user, KSTContainerClass containerCla
                               const std::string& identifier, bool transient = false,
                               std::optional<platform::Uuid> uuid = std::nullopt,
                               std::optional<PlistDictionary> info = std::nullopt);
+// The info dictionary of the container as its metadata file holds it; a file
+// that cannot be read is a test failure.
+std::optional<PlistDictionary> infoOnDisk(const KSTMetadataRef& container);
 // The live container the cache holds, if its directory is still there.
 KSTMetadataRef existingContainer(std::uint32_t user, KSTContainerClass containerClass,
                                  const std::string& identifier);
