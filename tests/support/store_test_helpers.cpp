@@ -66,6 +66,14 @@ std::vector<std::string> namesIn(const std::string& directory) {
   return names;
 }
 
+std::string stagingDirectory() {
+  return KSTGlobalConfiguration::sharedInstance().stagingDirectory().path();
+}
+
+std::string deathRowDirectory() {
+  return KSTGlobalConfiguration::sharedInstance().deathrowDirectory().path();
+}
+
 std::string classDirectory(std::uint32_t user, KSTContainerClass containerClass, bool transient) {
   auto url = KSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
       user, containerClass, transient);

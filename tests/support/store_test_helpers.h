@@ -49,6 +49,9 @@ std::string aclText(const std::string& path, acl_type_t type);
 // The names in a directory, sorted; none when it does not exist.
 std::vector<std::string> namesIn(const std::string& directory);
 
+// The daemon's staging and death-row directories.
+std::string stagingDirectory();
+std::string deathRowDirectory();
 // The class directory of a user's class (made when asked for).
 std::string classDirectory(std::uint32_t user, KSTContainerClass containerClass,
                            bool transient = false);
