@@ -38,13 +38,6 @@ class MigrationTest : public testing::StoreTest {
     std::ifstream in(path, std::ios::binary);
     return std::string(std::istreambuf_iterator<char>(in), {});
   }
-  // The info dictionary of the container as its metadata file on disk has it.
-  static std::optional<PlistDictionary> infoOnDisk(const KSTMetadataRef& container) {
-    KSTErrorRef error;
-    auto read = KSTMetadata::readAndValidateMetadataAtUrl(container->url(), container->uid(), false,
-                                                          &error);
-    return read ? read->info() : std::nullopt;
-  }
   static void removeMarkers() {
     for (const char* marker : {kKSTBundleMigrationMarker, kKSTACLMigrationMarker,
                                kKSTGroupIdMigrationMarker, kKSTCodeSigningMigrationMarker}) {
@@ -260,7 +253,7 @@ TEST_F(MigrationTest, OlderCodeSigningDataIsTakenOverAndUnnamedGroupsRemoved) {
   EXPECT_FALSE(fs::exists(legacyFile));
   for (const KSTMetadataRef& container : {grouped, known, app, framework}) {
     SCOPED_TRACE(container->identifier());
-    const auto info = infoOnDisk(container);
+    const auto info = testing::infoOnDisk(container);
     EXPECT_FALSE(info && (info->contains(kKSTGroupContainerIDsKey) ||
                           info->contains(kKSTCachedCodeSigningInfoKey)));
   }

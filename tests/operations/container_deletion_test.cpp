@@ -10,7 +10,6 @@
 
 #include "daemon/error_codes.h"
 #include "store/container_cache.h"
-#include "store/global_configuration.h"
 #include "support/store_test_helpers.h"
 
 namespace kestrel {
@@ -32,9 +31,7 @@ class ContainerDeletionTest : public testing::StoreTest {
                container->uid(), container->containerClass(), container->identifier(),
                container->uuid().string()) != nullptr;
   }
-  static fs::path deathRow() {
-    return KSTGlobalConfiguration::sharedInstance().deathrowDirectory().path();
-  }
+  static fs::path deathRow() { return testing::deathRowDirectory(); }
   // Staged directly: under its own directory name, not inside a holder.
   static bool staged(const KSTMetadataRef& container) {
     const fs::path place = container->url().path();

@@ -6,7 +6,6 @@
 
 #include "daemon/daemon_state.h"
 #include "daemon/error_codes.h"
-#include "store/global_configuration.h"
 #include "store/metadata.h"
 #include "support/store_test_helpers.h"
 
@@ -71,8 +70,7 @@ TEST_F(ContainerWipeTest, OnlyEntitledClientsWipeAndTheContainerKeepsItsPlaceAnd
   }
   // The old content went to death row, and the wipe's sweep took it away.
   KSTDeathRowQueue()->sync([] {});
-  EXPECT_TRUE(testing::namesIn(KSTGlobalConfiguration::sharedInstance().deathrowDirectory().path())
-                  .empty());
+  EXPECT_TRUE(testing::namesIn(testing::deathRowDirectory()).empty());
 }
 
 }  // namespace

@@ -23,15 +23,15 @@ namespace fs = std::filesystem;
 
 constexpr const char* kStaticDiskUsageKey = "com.zorvane.Tessel.StaticDiskUsage";
 
+std::uint64_t allocated(const std::string& path) {
+  return testing::statOf(path).st_blocks * 512;
+}
+
 // Writes a file of `bytes` bytes and gives the storage allocated to it.
 std::uint64_t writeFile(const std::string& path, std::size_t bytes) {
   fs::create_directories(fs::path(path).parent_path());
   std::ofstream(path) << std::string(bytes, 'x');
-  return testing::statOf(path).st_blocks * 512;
-}
-
-std::uint64_t allocated(const std::string& path) {
-  return testing::statOf(path).st_blocks * 512;
+  return allocated(path);
 }
 
 using DiskUsageTest = testing::StoreTest;

@@ -27,10 +27,9 @@ constexpr const char* kApp = "com.example.app";
 
 class ReplaceTest : public testing::StoreTest {
  protected:
-  static KSTGlobalConfiguration& layout() { return KSTGlobalConfiguration::sharedInstance(); }
-  static std::string replaceDirectory() { return layout().replaceDirectory().path(); }
-  static std::string staging() { return layout().stagingDirectory().path(); }
-  static std::string deathRow() { return layout().deathrowDirectory().path(); }
+  static std::string replaceDirectory() {
+    return KSTGlobalConfiguration::sharedInstance().replaceDirectory().path();
+  }
   // The live container of the identifier, as a lookup finds it now.
   static KSTMetadataRef live(const std::string& identifier, KSTContainerClass c = 2,
                              std::uint32_t user = 501) {
@@ -111,7 +110,7 @@ TEST_F(ReplaceTest, RefusalsLeaveDiskAndCacheAsTheyWere) {
     }
     EXPECT_EQ(live(kApp), old);
     EXPECT_TRUE(namesIn(replaceDirectory()).empty());
-    EXPECT_TRUE(namesIn(staging()).empty());
+    EXPECT_TRUE(namesIn(testing::stagingDirectory()).empty());
   }
   EXPECT_TRUE(fakes.logged("Container already exists at " + occupied));
 }
@@ -123,7 +122,7 @@ TEST_F(ReplaceTest, NewTakesTheOldPlaceAndTheOldGoesToDeathRowWithItsJournal) {
   ASSERT_EQ(replace(nullptr, first), kKSTSuccess);
   EXPECT_EQ(first->url().path(), testing::classDirectory(501, 2) + "/" + name);
   EXPECT_EQ(live("com.example.first"), first);
-  EXPECT_TRUE(namesIn(deathRow()).empty());
+  EXPECT_TRUE(namesIn(testing::deathRowDirectory()).empty());
 
   const KSTMetadataRef old = make(501, 2, kApp);
   std::ofstream(old->url().path() + "/Documents/old") << "old";
@@ -135,10 +134,10 @@ TEST_F(ReplaceTest, NewTakesTheOldPlaceAndTheOldGoesToDeathRowWithItsJournal) {
   EXPECT_EQ(fs::path(fresh->url().path()).parent_path(), testing::classDirectory(501, 2));
   EXPECT_FALSE(fresh->transient());
   EXPECT_TRUE(namesIn(replaceDirectory()).empty());
-  EXPECT_TRUE(namesIn(staging()).empty());
+  EXPECT_TRUE(namesIn(testing::stagingDirectory()).empty());
   // Parked old container and journal both wait in death row; no sweep was asked for.
   KSTDeathRowQueue()->sync([] {});
-  EXPECT_EQ(namesIn(deathRow()).size(), 2u);
+  EXPECT_EQ(namesIn(testing::deathRowDirectory()).size(), 2u);
   EXPECT_EQ(fakes.keepAlive->totalBegins(), 0u);
 }
 
@@ -163,7 +162,7 @@ TEST_F(ReplaceTest, SwapThatStopsHalfWayIsRolledBack) {
   EXPECT_EQ(live(kApp), old);
   EXPECT_TRUE(fs::exists(old->url().path() + "/.com.zorvane.kestrel.metadata.plist"));
   EXPECT_TRUE(namesIn(replaceDirectory()).empty());
-  EXPECT_TRUE(namesIn(staging()).empty());
+  EXPECT_TRUE(namesIn(testing::stagingDirectory()).empty());
   EXPECT_TRUE(fakes.logged(
       "Failed to replace: " + old->url().path() + " with: " + fresh->url().path() + " at: ",
       testing::Match::Contains));
@@ -174,7 +173,9 @@ TEST_F(ReplaceTest, SwapThatStopsHalfWayIsRolledBack) {
 TEST_F(ReplaceTest, RecoveryDiscardsWhatItCannotReadAndKeepsWhatItCannotUndo) {
   const std::string classDirectory = testing::classDirectory(501, 2);
   const auto place = [&](const std::string& name) { return classDirectory + "/" + name; };
-  const auto parked = [&](const std::string& name) { return staging() + "/" + name; };
+  const auto parked = [&](const std::string& name) {
+    return testing::stagingDirectory() + "/" + name;
+  };
   std::ofstream(replaceDirectory() + "/bad.plist") << "not a property list";
   KSTErrorRef error;
   ASSERT_TRUE(installer._recoverFromReplaceOperationsWithError(&error))
@@ -204,10 +205,10 @@ TEST_F(ReplaceTest, RecoveryDiscardsWhatItCannotReadAndKeepsWhatItCannotUndo) {
                                              {kKSTReplaceOperationNewURLKey, "/n"},
                                              {kKSTReplaceOperationStagingURLKey, 7},
                                              {kKSTReplaceOperationDestURLKey, "/d"}},
-                             KSTFileURL(staging() + "/j.plist"), kKSTDaemonFileWritingOptions,
-                             nullptr));
-  EXPECT_FALSE(
-      installer._readAndValidateReplaceFileAtUrl(KSTFileURL(staging() + "/j.plist"), &error));
+                             KSTFileURL(testing::stagingDirectory() + "/j.plist"),
+                             kKSTDaemonFileWritingOptions, nullptr));
+  EXPECT_FALSE(installer._readAndValidateReplaceFileAtUrl(
+      KSTFileURL(testing::stagingDirectory() + "/j.plist"), &error));
   EXPECT_TRUE(
       testing::isError(error, kKSTErrorReplaceRecoveryFailed,
                        "Invalid replace data: Old: relative, New: /n, Staging: 7, Dest: /d"));

@@ -1,10 +1,13 @@
 // Repairing a container in place and moving it to a new directory UUID: what
 // the disk, the cache and the sandbox mapping hold afterwards, and the
-// addresses every per-container operation refuses.
+// addresses every per-container operation (these two, info values, metadata
+// and disk usage) refuses.
 #include <gtest/gtest.h>
 
 #include <filesystem>
 #include <fstream>
+#include <functional>
+#include <tuple>
 
 #include "daemon/error_codes.h"
 #include "platform/file_system.h"
@@ -90,37 +93,74 @@ TEST_F(RepairTest, ANewDirectoryUUIDMovesTheContainerAndKeepsItsIdentity) {
   }
 }
 
+// Every per-container operation finds its container by user, class, internal
+// UUID and identifier: each refuses what cannot be named or found, alike.
 TEST_F(RepairTest, ContainersThatCannotBeNamedOrFoundAreRefusedByEveryOperation) {
   const KSTMetadataRef app = make(501, 2, "com.example.app");
   ASSERT_TRUE(app);
-  const std::string path = app->url().path();
+  // On disk, but never cached: not found either.
+  const KSTMetadataRef unknown = testing::writeContainer(501, 2, "com.example.unknown");
+  using Address = std::tuple<std::optional<platform::Uuid>, std::string, KSTContainerClass>;
+  using Operation = std::function<std::uint64_t(const Address&)>;
+  const auto codeOf = [&](auto operation) {
+    return [&, operation](const Address& address) {
+      const auto& [uuid, identifier, containerClass] = address;
+      std::uint64_t code = kKSTSuccess;
+      operation(uuid, identifier, containerClass, &code);
+      return code;
+    };
+  };
+  const std::pair<const char*, Operation> operations[] = {
+      {"set info value", codeOf([&](auto& u, auto& i, auto c, auto* e) {
+         installer.setInfoValue(PlistValue(true), "k", 501, u, i, c, true, e);
+       })},
+      {"info value", codeOf([&](auto& u, auto& i, auto c, auto* e) {
+         EXPECT_FALSE(installer.infoValueForKey("k", 501, u, i, c, true, e));
+       })},
+      {"metadata", codeOf([&](auto& u, auto& i, auto c, auto* e) {
+         EXPECT_FALSE(installer.metadataForUser(501, u, i, c, e));
+       })},
+      {"recreate", codeOf([&](auto& u, auto& i, auto c, auto* e) {
+         installer.recreateDefaultStructureForUser(501, u, i, c, e);
+       })},
+      {"new directory UUID", codeOf([&](auto& u, auto& i, auto c, auto* e) {
+         installer.regenerateDirectoryUUIDForUser(501, u, i, c, e);
+       })},
+      {"disk usage", codeOf([&](auto& u, auto& i, auto c, auto* e) {
+         EXPECT_EQ(installer.diskUsageForUserId(501, u, i, c, e), 0u);
+       })},
+  };
   const struct {
     const char* label;
-    std::optional<platform::Uuid> uuid;
-    KSTContainerClass containerClass;
+    Address address;
     std::uint64_t code;
   } rows[] = {
-      {"no UUID", std::nullopt, 2, kKSTErrorInvalidObject},
-      {"class 0", app->uuid(), 0, kKSTErrorInvalidObject},
-      {"class 14", app->uuid(), 14, kKSTErrorInvalidObject},
-      {"another UUID", platform::Uuid::random(), 2, kKSTErrorNotFound},
-      {"another class", app->uuid(), 4, kKSTErrorNotFound},
+      {"no UUID", {std::nullopt, "com.example.app", 2}, kKSTErrorInvalidObject},
+      {"class 0", {app->uuid(), "com.example.app", 0}, kKSTErrorInvalidObject},
+      {"class 14", {app->uuid(), "com.example.app", 14}, kKSTErrorInvalidObject},
+      {"another UUID", {platform::Uuid::random(), "com.example.app", 2}, kKSTErrorNotFound},
+      {"another class", {app->uuid(), "com.example.app", 4}, kKSTErrorNotFound},
+      {"not cached", {unknown->uuid(), "com.example.unknown", 2}, kKSTErrorNotFound},
   };
   for (const auto& row : rows) {
-    SCOPED_TRACE(row.label);
-    std::uint64_t recreate = kKSTSuccess, regenerate = kKSTSuccess, usage = kKSTSuccess;
-    installer.recreateDefaultStructureForUser(501, row.uuid, "com.example.app", row.containerClass,
-                                              &recreate);
-    installer.regenerateDirectoryUUIDForUser(501, row.uuid, "com.example.app", row.containerClass,
-                                             &regenerate);
-    EXPECT_EQ(
-        installer.diskUsageForUserId(501, row.uuid, "com.example.app", row.containerClass, &usage),
-        0u);
-    EXPECT_EQ(recreate, row.code);
-    EXPECT_EQ(regenerate, row.code);
-    EXPECT_EQ(usage, row.code);
+    for (const auto& [name, operation] : operations) {
+      SCOPED_TRACE(std::string(row.label) + ", " + name);
+      EXPECT_EQ(operation(row.address), row.code);
+    }
   }
-  EXPECT_TRUE(fs::is_directory(path));
+  EXPECT_TRUE(fakes.logged("Can't act on an invalid object: userId: 501, UUID: (null), Class: 2"));
+  EXPECT_TRUE(fakes.logged("No Container with userId: 501 UUID: "));
+  // Only the info values need a key.
+  std::uint64_t code = kKSTSuccess;
+  installer.setInfoValue(PlistValue(true), std::nullopt, 501, app->uuid(), "com.example.app", 2,
+                         true, &code);
+  EXPECT_EQ(code, kKSTErrorInvalidParameter);
+  EXPECT_TRUE(fakes.logged("Can't set nil or non-Strand key: (null)"));
+  EXPECT_FALSE(
+      installer.infoValueForKey(std::nullopt, 501, app->uuid(), "com.example.app", 2, true, &code));
+  EXPECT_EQ(code, kKSTErrorInvalidParameter);
+  EXPECT_TRUE(fs::is_directory(app->url().path()));
+  EXPECT_FALSE(testing::infoOnDisk(app));
 }
 
 TEST_F(RepairTest, AFailedMoveLeavesTheContainerItsMappingAndTheCacheAsTheyWere) {

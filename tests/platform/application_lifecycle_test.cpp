@@ -13,8 +13,7 @@
 #include <thread>
 
 #include "platform/linux/code_signing_identity_linux.h"
-#include "support/daemon_process.h"
-#include "support/scratch_root.h"
+#include "support/registered_clients.h"
 
 namespace kestrel::platform {
 namespace {
@@ -41,17 +40,8 @@ bool runs(pid_t pid, const std::string& executable) {
 
 TEST(ApplicationLifecycleTest, EndsTheRegisteredProcessesAndHoldsTheIdentityUntilInvalidated) {
   testing::ScratchRoot scratch;
-  const std::string sleeper = scratch.resolve("/bin/sleeper");
-  fs::create_directories(scratch.resolve("/bin"));
-  fs::copy_file("/bin/sleep", sleeper);
-  fs::create_directories(scratch.resolve("/etc/kestrel/signatures"));
-  fs::permissions(scratch.resolve("/etc/kestrel"), fs::perms(0755));
-  fs::permissions(scratch.resolve("/etc/kestrel/signatures"), fs::perms(0755));
-  scratch.writeFile("/etc/kestrel/signatures/sleeper.plist",
-                    "<plist version=\"1.0\"><dict><key>SigningIdentifier</key>"
-                    "<string>com.example.app</string><key>Executable</key><string>" +
-                        sleeper + "</string></dict></plist>");
-  fs::permissions(scratch.resolve("/etc/kestrel/signatures/sleeper.plist"), fs::perms(0644));
+  const std::string sleeper =
+      testing::registerProgram(scratch, "sleeper", "com.example.app", "", "/bin/sleep");
 
   const pid_t polite = testing::spawnProcess(sleeper, {"60"});
   // SIGTERM ignored across the exec: only SIGKILL ends this one.

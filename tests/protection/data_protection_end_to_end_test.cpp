@@ -6,7 +6,6 @@
 #include <sys/wait.h>
 
 #include <chrono>
-#include <filesystem>
 #include <fstream>
 #include <future>
 #include <thread>
@@ -17,7 +16,6 @@
 namespace kestrel {
 namespace {
 
-namespace fs = std::filesystem;
 using namespace std::chrono_literals;
 
 class DataProtectionEndToEndTest : public testing::RegisteredClientsTest {
@@ -27,12 +25,7 @@ class DataProtectionEndToEndTest : public testing::RegisteredClientsTest {
     // that just runs; both sign as com.example.app.
     registerClient("app-client", "com.example.app",
                    "<key>com.zorvane.private.Kestrel.none</key><true/>");
-    fs::copy_file("/bin/sleep", scratch.resolve("/bin/app"));
-    scratch.writeFile("/etc/kestrel/signatures/app.plist",
-                      "<plist version=\"1.0\"><dict><key>SigningIdentifier</key>"
-                      "<string>com.example.app</string><key>Executable</key><string>" +
-                          scratch.resolve("/bin/app") + "</string></dict></plist>");
-    fs::permissions(scratch.resolve("/etc/kestrel/signatures/app.plist"), fs::perms(0644));
+    testing::registerProgram(scratch, "app", "com.example.app", "", "/bin/sleep");
   }
 
   testing::ProcessResult protect(const char* protectionClass, bool retry) {

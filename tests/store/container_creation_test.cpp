@@ -14,7 +14,6 @@
 #include "platform/linux/extended_acl_linux.h"
 #include "store/container_class.h"
 #include "store/container_identifier.h"
-#include "store/global_configuration.h"
 #include "support/store_test_helpers.h"
 
 namespace kestrel {
@@ -48,9 +47,6 @@ class ContainerCreationTest : public testing::StoreTest {
     return installer.createOrLookupContainerForUser(user, identifier, createIfNecessary,
                                                     containerClass, transient, true, code);
   }
-  static std::string staging() {
-    return KSTGlobalConfiguration::sharedInstance().stagingDirectory().path();
-  }
 };
 
 TEST_F(ContainerCreationTest, DataContainerIsMadeOnceFoundListedAndInconsistentWithoutMetadata) {
@@ -73,7 +69,7 @@ TEST_F(ContainerCreationTest, DataContainerIsMadeOnceFoundListedAndInconsistentW
     EXPECT_EQ(ownerOf(directory / name), 501u) << name;
     EXPECT_EQ(modeOf(directory / name), 0755u) << name;
   }
-  EXPECT_TRUE(fs::is_empty(staging()));
+  EXPECT_TRUE(fs::is_empty(testing::stagingDirectory()));
   KSTMetadataRef again = create(501, 2, "com.example.app", &code, false, false);
   ASSERT_TRUE(again) << code;
   EXPECT_TRUE(again->existed());
@@ -187,8 +183,8 @@ TEST_F(ContainerCreationTest, BadInputOrAMissingEntitlementIsRefusedAndMakesNoth
       "com.example.daemon not entitled for a system container, but com.example.daemon is trying"));
   EXPECT_TRUE(namesIn(classDirectory(501, 2)).empty());
   EXPECT_TRUE(namesIn(classDirectory(499, 12)).empty());
-  EXPECT_TRUE(fs::is_empty(staging()));
-  const std::string deathRow = KSTGlobalConfiguration::sharedInstance().deathrowDirectory().path();
+  EXPECT_TRUE(fs::is_empty(testing::stagingDirectory()));
+  const std::string deathRow = testing::deathRowDirectory();
   for (const std::string& holder : namesIn(deathRow)) {
     EXPECT_TRUE(namesIn(deathRow + "/" + holder).empty()) << holder;
   }
@@ -212,7 +208,7 @@ TEST_F(ContainerCreationTest, WellKnownSystemContainerTakesItsNameAndAFailedMove
   EXPECT_TRUE(fakes.logged("Failed to move staging dir: ", testing::Match::Contains,
                            "createOrLookupContainerForUser"));
   EXPECT_EQ(treeOf(system / "com.zorvane.ternd"), Names{"left-over"});
-  EXPECT_TRUE(fs::is_empty(staging()));
+  EXPECT_TRUE(fs::is_empty(testing::stagingDirectory()));
 }
 
 using ContainerCreationConcurrencyTest = ContainerCreationTest;
@@ -251,7 +247,7 @@ TEST_F(ContainerCreationConcurrencyTest, RacingRequestsLeaveOneContainerPerIdent
   }
   EXPECT_EQ(containersOf, (std::map<std::string, int>{
                               {"com.example.a", 1}, {"com.example.b", 1}, {"com.example.c", 1}}));
-  EXPECT_TRUE(fs::is_empty(staging()));
+  EXPECT_TRUE(fs::is_empty(testing::stagingDirectory()));
 }
 
 }  // namespace

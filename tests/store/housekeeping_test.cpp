@@ -22,9 +22,6 @@ using Strings = std::vector<std::string>;
 class HousekeepingTest : public testing::StoreTest {
  protected:
   KSTClientConnection& shared = KSTClientConnection::sharedClientConnection();
-  static std::string deathRow() {
-    return KSTGlobalConfiguration::sharedInstance().deathrowDirectory().path();
-  }
   // Everything moved to death row is gone once the sweep ran.
   static void sweepEnds() {
     KSTDeathRowQueue()->sync([] {});
@@ -32,14 +29,14 @@ class HousekeepingTest : public testing::StoreTest {
 };
 
 TEST_F(HousekeepingTest, EveryStartRetiresStagingAndSweepsDeathRow) {
-  const std::string staging = KSTGlobalConfiguration::sharedInstance().stagingDirectory().path();
+  const std::string staging = testing::stagingDirectory();
   const std::string halfBuilt = staging + "/" + platform::Uuid::random().string();
   fs::create_directories(halfBuilt + "/Library");
-  std::ofstream(deathRow() + "/left-by-the-last-run") << "x";
+  std::ofstream(testing::deathRowDirectory() + "/left-by-the-last-run") << "x";
   shared.containerManagerCleanup();
   sweepEnds();
   EXPECT_TRUE(namesIn(staging).empty());
-  EXPECT_TRUE(namesIn(deathRow()).empty());
+  EXPECT_TRUE(namesIn(testing::deathRowDirectory()).empty());
 
   // A recovery that fails is logged, and start-up goes on.
   const std::string replace = KSTGlobalConfiguration::sharedInstance().replaceDirectory().path();

@@ -105,13 +105,8 @@ DaemonProcess::~DaemonProcess() {
 }
 
 int DaemonProcess::stop() {
-  if (pid_ <= 0) return -1;
-  ::kill(pid_, SIGTERM);
-  int status = 0;
-  ::waitpid(pid_, &status, 0);
-  pid_ = -1;
-  daemonPid_ = -1;
-  return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+  if (pid_ > 0) ::kill(pid_, SIGTERM);
+  return waitForExit();
 }
 
 int DaemonProcess::waitForExit() {

@@ -14,6 +14,13 @@
 
 namespace kestrel::testing {
 
+// Copies the program to /bin/<name> beneath the root and registers the copy
+// under the identifier, with the entitlements given as the inside of a
+// property-list <dict>; gives the copy's path.
+std::string registerProgram(const ScratchRoot& scratch, const std::string& name,
+                            const std::string& identifier, const std::string& entitlements,
+                            const std::string& program);
+
 class RegisteredClientsTest : public ::testing::Test {
  protected:
   RegisteredClientsTest();

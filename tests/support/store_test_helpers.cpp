@@ -66,6 +66,14 @@ std::vector<std::string> namesIn(const std::string& directory) {
   return names;
 }
 
+std::string stagingDirectory() {
+  return KSTGlobalConfiguration::sharedInstance().stagingDirectory().path();
+}
+
+std::string deathRowDirectory() {
+  return KSTGlobalConfiguration::sharedInstance().deathrowDirectory().path();
+}
+
 std::string classDirectory(std::uint32_t user, KSTContainerClass containerClass, bool transient) {
   auto url = KSTGlobalConfiguration::sharedInstance().containerDirectoryURLForUser(
       user, containerClass, transient);
@@ -87,6 +95,14 @@ KSTMetadataRef writeContainer(std::uint32_t user, KSTContainerClass containerCla
   KSTErrorRef error;
   EXPECT_TRUE(record->writeMetadataToDiskWithError(&error)) << messageOf(error);
   return record;
+}
+
+std::optional<PlistDictionary> infoOnDisk(const KSTMetadataRef& container) {
+  KSTErrorRef error;
+  auto read =
+      KSTMetadata::readAndValidateMetadataAtUrl(container->url(), container->uid(), true, &error);
+  EXPECT_TRUE(read) << messageOf(error);
+  return read ? read->info() : std::nullopt;
 }
 
 KSTMetadataRef existingContainer(std::uint32_t user, KSTContainerClass containerClass,

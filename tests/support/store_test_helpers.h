@@ -49,6 +49,9 @@ std::string aclText(const std::string& path, acl_type_t type);
 // The names in a directory, sorted; none when it does not exist.
 std::vector<std::string> namesIn(const std::string& directory);
 
+// The daemon's staging and death-row directories.
+std::string stagingDirectory();
+std::string deathRowDirectory();
 // The class directory of a user's class (made when asked for).
 std::string classDirectory(std::uint32_t user, KSTContainerClass containerClass,
                            bool transient = false);
@@ -58,6 +61,9 @@ KSTMetadataRef writeContainer(std::uint32_t user, KSTContainerClass containerCla
                               const std::string& identifier, bool transient = false,
                               std::optional<platform::Uuid> uuid = std::nullopt,
                               std::optional<PlistDictionary> info = std::nullopt);
+// The info dictionary of the container as its metadata file holds it; a file
+// that cannot be read is a test failure.
+std::optional<PlistDictionary> infoOnDisk(const KSTMetadataRef& container);
 // The live container the cache holds, if its directory is still there.
 KSTMetadataRef existingContainer(std::uint32_t user, KSTContainerClass containerClass,
                                  const std::string& identifier);

@@ -393,8 +393,16 @@ struct Scenario {
   std::function<void(Trial&, const Before&, Problems*)> check;
 };
 
-const std::vector<Scenario>& scenarios() {
-  static const std::vector<Scenario> all = {
+// A replace killed at its first point leaves a state that the restarted
+// daemon must deal with; these scenarios crash it again while it does.
+struct SecondCrash {
+  const char* name;
+  std::vector<std::string> points;
+  const char* firstCrash;  // where the replace that leaves the state behind is killed
+};
+
+std::vector<Scenario> makeScenarios() {
+  std::vector<Scenario> all = {
       {"create",
        {"create.metadata-written", "create.in-place", "create.cached"},
        [](Trial&) { return Before{}; },
@@ -491,35 +499,33 @@ const std::vector<Scenario>& scenarios() {
            p->push_back("deleted container in neither state: code " + std::to_string(live.code));
          }
        }},
+  };
+  const SecondCrash secondCrashes[] = {
+      // The old container parked, and a journal.
       {"recovery",
        {"recovery.rolled-back", "recovery.journal-retired", "death-row.holder-made"},
-       [](Trial& t) {
-         Before before{t.make(kApp, false, "old"), t.make(kApp, true, "new")};
-         // A first crash leaves the old container parked and a journal.
-         t.stop();
-         t.start("replace.old-parked");
-         t.replace(before.old, before.fresh);
-         t.killedWithin(20s);
-         return before;
-       },
-       nullptr,
-       true,
-       checkReplaced},
-      {"cleanup",
-       {"cleanup.staging-retired", "death-row.moved"},
-       [](Trial& t) {
-         Before before{t.make(kApp, false, "old"), t.make(kApp, true, "new")};
-         // A first crash leaves the parked old container in staging, swap done.
-         t.stop();
-         t.start("replace.new-in-place");
-         t.replace(before.old, before.fresh);
-         t.killedWithin(20s);
-         return before;
-       },
-       nullptr,
-       true,
-       checkReplaced},
+       "replace.old-parked"},
+      // The parked old container in staging, the swap done.
+      {"cleanup", {"cleanup.staging-retired", "death-row.moved"}, "replace.new-in-place"},
   };
+  for (const SecondCrash& second : secondCrashes) {
+    const std::string firstCrash = second.firstCrash;
+    all.push_back({second.name, second.points,
+                   [firstCrash](Trial& t) {
+                     Before before{t.make(kApp, false, "old"), t.make(kApp, true, "new")};
+                     t.stop();
+                     t.start(firstCrash);
+                     t.replace(before.old, before.fresh);
+                     t.killedWithin(20s);
+                     return before;
+                   },
+                   nullptr, true, checkReplaced});
+  }
+  return all;
+}
+
+const std::vector<Scenario>& scenarios() {
+  static const std::vector<Scenario> all = makeScenarios();
   return all;
 }
 
