@@ -3,7 +3,8 @@
 # root, then times kestrel-run from its start to the first instruction of a
 # program it starts in an app's containers (made by the first launch),
 # against bwrap started directly with the same command line, alternating,
-# and writes bench/results/launch-<stamp>/result.txt.
+# and writes bench/results/launch-<stamp>/result.txt. KESTREL_RUN_ALSO names
+# another kestrel-run binary (an earlier build) timed in the same rounds.
 #
 #   bench/launch.sh [rounds]      # default 200 of each
 set -euo pipefail
@@ -26,7 +27,7 @@ for _ in $(seq 200); do [[ -S "$root/run/kestrel/com.zorvane.kestreld.upcall" ]]
 
 out="$here/results/launch-$(date -u +%Y%m%dT%H%M%SZ)"
 mkdir -p "$out"
-"$build_dir/bench/kestrel_launch_bench" --rounds "$rounds" -- \
+"$build_dir/bench/kestrel_launch_bench" --rounds "$rounds" ${KESTREL_RUN_ALSO:+--also "$KESTREL_RUN_ALSO"} -- \
   "$build_dir/tools/kestrel-run" --root "$root" --identifier com.zorvane.kestrel.bench.app \
   --user 501 --group group.com.zorvane.kestrel.bench -- "$build_dir/bench/kestrel_launch_stamp" |
   tee "$out/result.txt"

@@ -2,9 +2,10 @@
 // program it starts, against bwrap started directly with the same command
 // line (what kestrel-run --print-command gives) in the same run, the two
 // alternating. The program prints the monotonic clock as it starts; the
-// clock is read here just before the fork.
+// clock is read here just before the fork. --also runs another kestrel-run
+// binary (an earlier build, say) with the same arguments in the same rounds.
 //
-//   kestrel_launch_bench --rounds N -- KESTREL-RUN-COMMAND... -- STAMP
+//   kestrel_launch_bench --rounds N [--also KESTREL-RUN] -- KESTREL-RUN-COMMAND... -- STAMP
 #include <fcntl.h>
 #include <sys/wait.h>
 #include <time.h>
@@ -63,10 +64,12 @@ double percentile(std::vector<double> values, double p) {
 
 int main(int argc, char** argv) {
   int rounds = 200;
+  std::string also;
   std::vector<std::string> launcher;
   int i = 1;
   for (; i < argc && std::strcmp(argv[i], "--") != 0; ++i) {
     if (std::strcmp(argv[i], "--rounds") == 0 && i + 1 < argc) rounds = std::atoi(argv[++i]);
+    if (std::strcmp(argv[i], "--also") == 0 && i + 1 < argc) also = argv[++i];
   }
   for (++i; i < argc; ++i) launcher.push_back(argv[i]);
   const auto separator = std::find(launcher.begin(), launcher.end(), "--");
@@ -88,12 +91,17 @@ int main(int argc, char** argv) {
   std::istringstream lines(printed);
   for (std::string line; std::getline(lines, line);) direct.push_back(line);
 
-  std::vector<double> viaLauncher, viaBwrap;
+  std::vector<std::string> other = launcher;
+  if (!also.empty()) other[0] = also;
+  std::vector<double> viaLauncher, viaBwrap, viaOther;
+  std::vector<std::pair<std::vector<double>*, const std::vector<std::string>*>> phases = {
+      {&viaLauncher, &launcher}, {&viaBwrap, &direct}};
+  if (!also.empty()) phases.emplace_back(&viaOther, &other);
   for (int round = -5; round < rounds; ++round) {  // five rounds of warming up
-    for (auto* samples : {&viaLauncher, &viaBwrap}) {
+    for (const auto& [samples, command] : phases) {
       std::string output;
       long long startedAt = 0;
-      if (!runCommand(samples == &viaLauncher ? launcher : direct, &output, &startedAt)) {
+      if (!runCommand(*command, &output, &startedAt)) {
         std::cerr << "a launch failed\n";
         return 1;
       }
@@ -109,5 +117,12 @@ int main(int argc, char** argv) {
   std::printf("ratio p50 %.2fx, p90 %.2fx\n",
               percentile(viaLauncher, 0.5) / percentile(viaBwrap, 0.5),
               percentile(viaLauncher, 0.9) / percentile(viaBwrap, 0.9));
+  if (!also.empty()) {
+    std::printf("%-12s %10.0f %10.0f  (%s)\n", "also", percentile(viaOther, 0.5),
+                percentile(viaOther, 0.9), also.c_str());
+    std::printf("also: ratio p50 %.2fx, p90 %.2fx\n",
+                percentile(viaOther, 0.5) / percentile(viaBwrap, 0.5),
+                percentile(viaOther, 0.9) / percentile(viaBwrap, 0.9));
+  }
   return 0;
 }

@@ -13,8 +13,6 @@
 
 #include "daemon/client_connection.h"
 #include "daemon/error_codes.h"
-#include "daemon/exceptions.h"
-#include "daemon/locks.h"
 #include "daemon/log.h"
 #include "operations/container_address.h"
 #include "platform/entry_scan.h"
@@ -102,53 +100,43 @@ std::uint64_t KSTClientConnection::diskUsageForUserId(std::uint32_t userId,
                                                       const std::optional<std::string>& identifier,
                                                       KSTContainerClass containerClass,
                                                       std::uint64_t* withError) {
-  if (KSTErrorRef invalid = KSTInvalidContainerAddress(__func__, userId, uuid, containerClass)) {
-    KSTHandOverCode(invalid, withError);
-    return 0;
-  }
   const char* const function = __func__;
-  return KST_CATCH_EXCEPTIONS(withError, std::uint64_t{0}, [&]() -> std::uint64_t {
-    // Held for writing across the read of the kept figure, the walk and the
-    // store, which therefore run with useLocking unset.
-    const std::string uuidString = uuid->string();
-    const KSTIdentifierLockGuard lock(uuidString, kKSTLockForWriting);
+  // Held for writing across the read of the kept figure, the walk and the
+  // store, which therefore run with useLocking unset.
+  return KSTOnCachedContainer(
+      function, userId, uuid, identifier, containerClass, KSTContainerLock::Writing, withError,
+      [&](const KSTMetadataRef& container) -> std::uint64_t {
+        const bool keepsFigure = KSTIsBundleClass(containerClass);
+        if (keepsFigure) {
+          std::uint64_t code = kKSTSuccess;
+          const std::optional<PlistValue> kept = infoValueForKey(
+              kStaticDiskUsageKey, userId, uuid, identifier, containerClass, false, &code);
+          if (!kept && code != kKSTErrorInfoValueNotFound) {
+            KSTLogTag(
+                kLogError, function,
+                "Error looking up info value for userId: %u, identifier: %@, Class: %llu: %llu",
+                userId, identifier, containerClass, code);
+          }
+          if (kept) {
+            if (const std::optional<std::uint64_t> bytes = kept->unsignedInteger()) return *bytes;
+          }
+        }
 
-    KSTErrorRef failure;
-    const KSTMetadataRef container =
-        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
-    if (!container) {
-      KSTHandOverCode(failure, withError);
-      return 0;
-    }
-    const bool keepsFigure = KSTIsBundleClass(containerClass);
-    if (keepsFigure) {
-      std::uint64_t code = kKSTSuccess;
-      const std::optional<PlistValue> kept = infoValueForKey(
-          kStaticDiskUsageKey, userId, uuid, identifier, containerClass, false, &code);
-      if (!kept && code != kKSTErrorInfoValueNotFound) {
-        KSTLogTag(kLogError, function,
-                  "Error looking up info value for userId: %u, identifier: %@, Class: %llu: %llu",
-                  userId, identifier, containerClass, code);
-      }
-      if (kept) {
-        if (const std::optional<std::uint64_t> bytes = kept->unsignedInteger()) return *bytes;
-      }
-    }
+        const std::uint64_t usage =
+            KSTFileManager::defaultManager().diskUsageForURL(container->url());
 
-    const std::uint64_t usage = KSTFileManager::defaultManager().diskUsageForURL(container->url());
-
-    if (keepsFigure) {
-      std::uint64_t code = kKSTSuccess;
-      setInfoValue(PlistValue(usage), kStaticDiskUsageKey, userId, uuid, identifier, containerClass,
-                   false, &code);
-      if (code != kKSTSuccess) {
-        KSTLogTag(kLogError, function,
-                  "Error setting info value for userId: %u, identifier: %@, Class: %llu: %llu",
-                  userId, identifier, containerClass, code);
-      }
-    }
-    return usage;
-  });
+        if (keepsFigure) {
+          std::uint64_t code = kKSTSuccess;
+          setInfoValue(PlistValue(usage), kStaticDiskUsageKey, userId, uuid, identifier,
+                       containerClass, false, &code);
+          if (code != kKSTSuccess) {
+            KSTLogTag(kLogError, function,
+                      "Error setting info value for userId: %u, identifier: %@, Class: %llu: %llu",
+                      userId, identifier, containerClass, code);
+          }
+        }
+        return usage;
+      });
 }
 
 }  // namespace kestrel

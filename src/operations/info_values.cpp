@@ -9,8 +9,6 @@
 #include "daemon/client_connection.h"
 #include "daemon/error_codes.h"
 #include "daemon/errors.h"
-#include "daemon/exceptions.h"
-#include "daemon/locks.h"
 #include "operations/container_address.h"
 #include "store/container_cache.h"
 #include "store/container_class.h"
@@ -24,98 +22,69 @@ void KSTClientConnection::setInfoValue(const std::optional<PlistValue>& value,
                                        const std::optional<std::string>& identifier,
                                        KSTContainerClass containerClass, bool useLocking,
                                        std::uint64_t* withError) {
-  if (KSTErrorRef invalid = KSTInvalidContainerAddress(__func__, userId, uuid, containerClass)) {
-    KSTHandOverCode(invalid, withError);
-    return;
-  }
-  if (!forKey) {
-    KSTHandOverCode(KST_ERROR(kKSTErrorInvalidParameter, nullptr, true,
-                              "Can't set nil or non-Strand key: %@", forKey),
-                    withError);
-    return;
-  }
-
   const char* const function = __func__;
-  KST_CATCH_EXCEPTIONS(withError, [&] {
-    const std::string uuidString = uuid->string();
-    std::optional<KSTIdentifierLockGuard> lock;
-    if (useLocking) lock.emplace(uuidString, kKSTLockForWriting);
+  const auto keyGiven = [&]() -> KSTErrorRef {
+    if (forKey) return nullptr;
+    return KST_ERROR_IN(function, kKSTErrorInvalidParameter, nullptr, true,
+                        "Can't set nil or non-Strand key: %@", forKey);
+  };
+  KSTOnCachedContainer(function, userId, uuid, identifier, containerClass,
+                       useLocking ? KSTContainerLock::Writing : KSTContainerLock::None, withError,
+                       keyGiven, [&](const KSTMetadataRef& container) {
+                         const std::optional<PlistDictionary> before = container->info();
+                         PlistDictionary info = before.value_or(PlistDictionary{});
+                         if (value) {
+                           info.insert_or_assign(*forKey, *value);
+                         } else {
+                           info.erase(*forKey);
+                         }
+                         container->setInfo(std::move(info));
+                         KSTErrorRef failure;
+                         if (!container->writeMetadataToDiskWithError(&failure)) {
+                           // The record keeps agreeing with its file.
+                           container->setInfo(before);
+                           KSTHandOverCode(failure, withError);
+                           return;
+                         }
 
-    KSTErrorRef failure;
-    const KSTMetadataRef container =
-        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
-    if (!container) {
-      KSTHandOverCode(failure, withError);
-      return;
-    }
-
-    const std::optional<PlistDictionary> before = container->info();
-    PlistDictionary info = before.value_or(PlistDictionary{});
-    if (value) {
-      info.insert_or_assign(*forKey, *value);
-    } else {
-      info.erase(*forKey);
-    }
-    container->setInfo(std::move(info));
-    if (!container->writeMetadataToDiskWithError(&failure)) {
-      // The record keeps agreeing with its file.
-      container->setInfo(before);
-      KSTHandOverCode(failure, withError);
-      return;
-    }
-
-    const KSTFileURL url = container->url();
-    const bool transient = container->transient();
-    KSTErrorRef cacheError;
-    if (!KSTContainerCache::sharedInstance().addContainerMetadata(container, userId, url, transient,
-                                                                  &cacheError)) {
-      KSTHandOverCode(KST_ERROR_IN(function, kKSTErrorCacheAddFailed, cacheError, true,
-                                   "Failed to add to cache: %@, url: %@, transient: %d", container,
-                                   url, transient ? 1 : 0),
-                      withError);
-    }
-  });
+                         const KSTFileURL url = container->url();
+                         const bool transient = container->transient();
+                         KSTErrorRef cacheError;
+                         if (!KSTContainerCache::sharedInstance().addContainerMetadata(
+                                 container, userId, url, transient, &cacheError)) {
+                           KSTHandOverCode(
+                               KST_ERROR_IN(function, kKSTErrorCacheAddFailed, cacheError, true,
+                                            "Failed to add to cache: %@, url: %@, transient: %d",
+                                            container, url, transient ? 1 : 0),
+                               withError);
+                         }
+                       });
 }
 
 std::optional<PlistValue> KSTClientConnection::infoValueForKey(
     const std::optional<std::string>& key, std::uint32_t userId,
     const std::optional<platform::Uuid>& uuid, const std::optional<std::string>& identifier,
     KSTContainerClass containerClass, bool useLocking, std::uint64_t* withError) {
-  if (KSTErrorRef invalid = KSTInvalidContainerAddress(__func__, userId, uuid, containerClass)) {
-    KSTHandOverCode(invalid, withError);
-    return std::nullopt;
-  }
-  if (!key) {
-    KSTHandOverCode(KST_ERROR(kKSTErrorInvalidParameter, nullptr, true,
-                              "Can't get nil or non-Strand key: %@", key),
-                    withError);
-    return std::nullopt;
-  }
-
   const char* const function = __func__;
-  using Result = std::optional<PlistValue>;
-  return KST_CATCH_EXCEPTIONS(withError, std::nullopt, [&]() -> Result {
-    const std::string uuidString = uuid->string();
-    std::optional<KSTIdentifierLockGuard> lock;
-    if (useLocking) lock.emplace(uuidString, kKSTLockForReading);
-
-    KSTErrorRef failure;
-    const KSTMetadataRef container =
-        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
-    if (!container) {
-      KSTHandOverCode(failure, withError);
-      return std::nullopt;
-    }
-    const std::optional<PlistDictionary> info = container->info();
-    if (info) {
-      if (const auto found = info->find(*key); found != info->end()) return found->second;
-    }
-    // An ordinary answer, not a fault: no log line.
-    KSTHandOverCode(KST_ERROR_IN(function, kKSTErrorInfoValueNotFound, nullptr, false,
-                                 "Didn't find info value for key: %@", key),
-                    withError);
-    return std::nullopt;
-  });
+  const auto keyGiven = [&]() -> KSTErrorRef {
+    if (key) return nullptr;
+    return KST_ERROR_IN(function, kKSTErrorInvalidParameter, nullptr, true,
+                        "Can't get nil or non-Strand key: %@", key);
+  };
+  return KSTOnCachedContainer(
+      function, userId, uuid, identifier, containerClass,
+      useLocking ? KSTContainerLock::Reading : KSTContainerLock::None, withError, keyGiven,
+      [&](const KSTMetadataRef& container) -> std::optional<PlistValue> {
+        const std::optional<PlistDictionary> info = container->info();
+        if (info) {
+          if (const auto found = info->find(*key); found != info->end()) return found->second;
+        }
+        // An ordinary answer, not a fault: no log line.
+        KSTHandOverCode(KST_ERROR_IN(function, kKSTErrorInfoValueNotFound, nullptr, false,
+                                     "Didn't find info value for key: %@", key),
+                        withError);
+        return std::nullopt;
+      });
 }
 
 KSTMetadataRef KSTClientConnection::metadataForUser(std::uint32_t userId,
@@ -123,21 +92,9 @@ KSTMetadataRef KSTClientConnection::metadataForUser(std::uint32_t userId,
                                                     const std::optional<std::string>& identifier,
                                                     KSTContainerClass containerClass,
                                                     std::uint64_t* withError) {
-  if (KSTErrorRef invalid =
-          KSTInvalidContainerAddress(__func__, userId, withUUID, containerClass)) {
-    KSTHandOverCode(invalid, withError);
-    return nullptr;
-  }
-  const char* const function = __func__;
-  return KST_CATCH_EXCEPTIONS(withError, nullptr, [&]() -> KSTMetadataRef {
-    const std::string uuidString = withUUID->string();
-    const KSTIdentifierLockGuard lock(uuidString, kKSTLockForReading);
-    KSTErrorRef failure;
-    KSTMetadataRef container =
-        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
-    if (!container) KSTHandOverCode(failure, withError);
-    return container;
-  });
+  return KSTOnCachedContainer(__func__, userId, withUUID, identifier, containerClass,
+                              KSTContainerLock::Reading, withError,
+                              [](const KSTMetadataRef& container) { return container; });
 }
 
 }  // namespace kestrel

@@ -5,8 +5,6 @@
 // the internal UUID, stays the same.
 #include "daemon/client_connection.h"
 #include "daemon/error_codes.h"
-#include "daemon/exceptions.h"
-#include "daemon/locks.h"
 #include "daemon/log.h"
 #include "operations/container_address.h"
 #include "store/container_cache.h"
@@ -18,84 +16,60 @@ void KSTClientConnection::recreateDefaultStructureForUser(
     std::uint32_t userId, const std::optional<platform::Uuid>& withUUID,
     const std::optional<std::string>& identifier, KSTContainerClass containerClass,
     std::uint64_t* withError) {
-  if (KSTErrorRef invalid =
-          KSTInvalidContainerAddress(__func__, userId, withUUID, containerClass)) {
-    KSTHandOverCode(invalid, withError);
-    return;
-  }
-  const char* const function = __func__;
-  KST_CATCH_EXCEPTIONS(withError, [&] {
-    const std::string uuidString = withUUID->string();
-    const KSTIdentifierLockGuard lock(uuidString, kKSTLockForWriting);
-
-    KSTErrorRef failure;
-    const KSTMetadataRef container =
-        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
-    if (!container) {
-      KSTHandOverCode(failure, withError);
-      return;
-    }
-    const KSTFileURL url = container->url();
-    if (!_createSubDirectories(url, userId, containerClass, &failure)) {
-      KSTHandOverCode(failure, withError);
-      return;
-    }
-    if (KSTIsSystemClass(containerClass) &&
-        !KSTFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(url, &failure)) {
-      KSTHandOverCode(failure, withError);
-    }
-  });
+  KSTOnCachedContainer(
+      __func__, userId, withUUID, identifier, containerClass, KSTContainerLock::Writing, withError,
+      [&](const KSTMetadataRef& container) {
+        const KSTFileURL url = container->url();
+        KSTErrorRef failure;
+        if (!_createSubDirectories(url, userId, containerClass, &failure)) {
+          KSTHandOverCode(failure, withError);
+          return;
+        }
+        if (KSTIsSystemClass(containerClass) &&
+            !KSTFileManager::defaultManager().standardizeACLsForSystemContainerAtURL(url,
+                                                                                     &failure)) {
+          KSTHandOverCode(failure, withError);
+        }
+      });
 }
 
 void KSTClientConnection::regenerateDirectoryUUIDForUser(
     std::uint32_t userId, const std::optional<platform::Uuid>& withInternalUUID,
     const std::optional<std::string>& identifier, KSTContainerClass containerClass,
     std::uint64_t* withError) {
-  if (KSTErrorRef invalid =
-          KSTInvalidContainerAddress(__func__, userId, withInternalUUID, containerClass)) {
-    KSTHandOverCode(invalid, withError);
-    return;
-  }
   const char* const function = __func__;
-  KST_CATCH_EXCEPTIONS(withError, [&] {
-    const std::string uuidString = withInternalUUID->string();
-    const KSTIdentifierLockGuard lock(uuidString, kKSTLockForWriting);
+  KSTOnCachedContainer(
+      function, userId, withInternalUUID, identifier, containerClass, KSTContainerLock::Writing,
+      withError, [&](const KSTMetadataRef& container) {
+        const KSTFileURL oldURL = container->url();
+        const KSTFileURL newURL =
+            oldURL.deletingLastPathComponent().appending(platform::Uuid::random().string(), true);
 
-    KSTErrorRef failure;
-    const KSTMetadataRef container =
-        KSTCachedContainer(function, userId, uuidString, identifier, containerClass, &failure);
-    if (!container) {
-      KSTHandOverCode(failure, withError);
-      return;
-    }
-    const KSTFileURL oldURL = container->url();
-    const KSTFileURL newURL =
-        oldURL.deletingLastPathComponent().appending(platform::Uuid::random().string(), true);
-
-    // A failed move leaves the container, its mapping and the cache as they were.
-    KSTErrorRef moveError;
-    if (!KSTFileManager::defaultManager().moveItemAtURL(oldURL, newURL, &moveError)) {
-      KSTHandOverCode(KST_ERROR_IN(function, kKSTErrorRegenerateUUIDFailed, moveError, true,
-                                   "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL),
-                      withError);
-      return;
-    }
-    if (!_setSandboxContainerMappingForUser(userId, container->identifier(), containerClass,
-                                            newURL)) {
-      KSTLogTag(kLogError, function,
-                "Failed to set container mapping in regenerate operation of %@, %llu",
-                container->identifier(), containerClass);
-    }
-    const bool transient = container->transient();
-    KSTErrorRef cacheError;
-    if (!KSTContainerCache::sharedInstance().addContainerMetadata(container, userId, newURL,
-                                                                  transient, &cacheError)) {
-      KSTHandOverCode(KST_ERROR_IN(function, kKSTErrorCacheAddFailed, cacheError, true,
-                                   "Failed to add to cache: %@, url: %@, transient: %d", container,
-                                   newURL, transient ? 1 : 0),
-                      withError);
-    }
-  });
+        // A failed move leaves the container, its mapping and the cache as they were.
+        KSTErrorRef moveError;
+        if (!KSTFileManager::defaultManager().moveItemAtURL(oldURL, newURL, &moveError)) {
+          KSTHandOverCode(
+              KST_ERROR_IN(function, kKSTErrorRegenerateUUIDFailed, moveError, true,
+                           "Failed to move dir: %@ to new UUID dir: %@", oldURL, newURL),
+              withError);
+          return;
+        }
+        if (!_setSandboxContainerMappingForUser(userId, container->identifier(), containerClass,
+                                                newURL)) {
+          KSTLogTag(kLogError, function,
+                    "Failed to set container mapping in regenerate operation of %@, %llu",
+                    container->identifier(), containerClass);
+        }
+        const bool transient = container->transient();
+        KSTErrorRef cacheError;
+        if (!KSTContainerCache::sharedInstance().addContainerMetadata(container, userId, newURL,
+                                                                      transient, &cacheError)) {
+          KSTHandOverCode(KST_ERROR_IN(function, kKSTErrorCacheAddFailed, cacheError, true,
+                                       "Failed to add to cache: %@, url: %@, transient: %d",
+                                       container, newURL, transient ? 1 : 0),
+                          withError);
+        }
+      });
 }
 
 }  // namespace kestrel

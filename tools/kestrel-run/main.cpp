@@ -98,13 +98,20 @@ int main(int argc, char** argv) {
   if (!kestrelctl::buildUpcallRequest(request, &datagram, &error)) return fail(kExitUsage, error);
   std::optional<platform::UpcallClient> client = platform::UpcallClient::connect(socket, &error);
   if (!client) return fail(kExitUnreachable, "cannot reach " + socket + ": " + error);
-  const auto outcome = client->call(datagram, std::chrono::seconds(timeoutSeconds));
+  if (!client->send(datagram, &error)) {
+    return fail(kExitUnreachable, "no answer from the daemon: " + error);
+  }
+  // While the daemon answers: the account of the user asked for, who owns the
+  // containers (an account database that is not files can take a while).
+  std::optional<run::AccountLookup> ahead;
+  if (user) ahead = run::AccountLookup{*user, run::accountOf(*user)};
+  const auto outcome = client->receive(std::chrono::seconds(timeoutSeconds));
   if (outcome.status != platform::UpcallClient::Status::Reply) {
     return fail(kExitUnreachable, "no answer from the daemon: " + outcome.message);
   }
   const auto reply = kestrelctl::decodeUpcallReply(outcome.reply, &error);
   if (!reply) return fail(kExitRefused, "a malformed reply: " + error);
-  const auto plan = run::planFromReply(*reply, &error);
+  const auto plan = run::planFromReply(*reply, ahead ? &*ahead : nullptr, &error);
   if (!plan) return fail(kExitRefused, error + "; nothing started");
 
   const std::vector<std::string> command = run::bwrapCommand(*plan, launch, program);

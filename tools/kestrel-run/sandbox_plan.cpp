@@ -1,7 +1,5 @@
 #include "sandbox_plan.h"
 
-#include <grp.h>
-#include <pwd.h>
 #include <sys/stat.h>
 
 #include <cerrno>
@@ -13,22 +11,6 @@ namespace kestrel::run {
 
 namespace {
 
-// The user's groups from the system's account database; none for a user
-// it does not know.
-std::vector<gid_t> groupsOf(uid_t uid, gid_t gid) {
-  struct passwd entry {};
-  struct passwd* found = nullptr;
-  std::vector<char> buffer(16384);
-  if (::getpwuid_r(uid, &entry, buffer.data(), buffer.size(), &found) != 0 || found == nullptr) {
-    return {};
-  }
-  int count = 64;
-  std::vector<gid_t> groups(count);
-  while (::getgrouplist(entry.pw_name, gid, groups.data(), &count) < 0) groups.resize(count);
-  groups.resize(count);
-  return groups;
-}
-
 std::string joined(const std::vector<gid_t>& groups) {
   std::string text;
   for (const gid_t group : groups) text += (text.empty() ? "" : ",") + std::to_string(group);
@@ -38,7 +20,7 @@ std::string joined(const std::vector<gid_t>& groups) {
 }  // namespace
 
 std::optional<SandboxPlan> planFromReply(const kestrelctl::DecodedUpcallReply& reply,
-                                         std::string* error) {
+                                         const AccountLookup* ahead, std::string* error) {
   if (reply.returnCode != 0) {
     *error = "the daemon answered return code " + std::to_string(reply.returnCode) + " (" +
              kestrelctl::upcallReturnCodeText(reply.returnCode) + ")";
@@ -81,7 +63,9 @@ std::optional<SandboxPlan> planFromReply(const kestrelctl::DecodedUpcallReply& r
   }
   plan.uid = owner.st_uid;
   plan.gid = owner.st_gid;
-  plan.supplementaryGroups = groupsOf(plan.uid, plan.gid);
+  const std::optional<Account> account =
+      ahead != nullptr && ahead->uid == plan.uid ? ahead->account : accountOf(plan.uid);
+  if (account) plan.supplementaryGroups = groupsOf(*account, plan.gid);
   if (plan.temporaryDirectory.empty()) plan.temporaryDirectory = plan.dataContainer + "/tmp";
   return plan;
 }

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "kestrel-run/user_groups.h"
 #include "kestrelctl/upcall_command.h"
 
 namespace kestrel::run {
@@ -23,8 +24,11 @@ struct SandboxPlan {
 
 // The plan for a reply, or nothing with the reason: a return code other than
 // 0, a status other than 1, no data container, or one that cannot be looked at.
+// The groups are those of the data container's owner (none for a user no
+// account database knows), starting with the container's group; `ahead`, when
+// given, is that owner's account if it was looked up already.
 std::optional<SandboxPlan> planFromReply(const kestrelctl::DecodedUpcallReply& reply,
-                                         std::string* error);
+                                         const AccountLookup* ahead, std::string* error);
 
 struct LaunchOptions {
   std::string root = "/";  // the daemon's root: its private/var is hidden

@@ -22,6 +22,18 @@ int sendDatagram(int fd, std::span<const std::uint8_t> request) {
   }
 }
 
+// What a failed send means to the caller.
+UpcallClient::Outcome sendFailure(int failure) {
+  UpcallClient::Outcome outcome;
+  if (failure == EPIPE || failure == ECONNRESET) {
+    outcome.status = UpcallClient::Status::Closed;
+    outcome.message = "the service closed the connection";
+  } else {
+    outcome.message = std::string("send: ") + std::strerror(failure);
+  }
+  return outcome;
+}
+
 }  // namespace
 
 std::string upcallSocketPath(const FilesystemRoot& root, const std::string& serviceName) {
@@ -48,7 +60,7 @@ std::optional<UpcallClient> UpcallClient::connect(const std::string& socketPath,
 
 bool UpcallClient::send(std::span<const std::uint8_t> request, std::string* error) {
   const int failure = sendDatagram(fd_.get(), request);
-  if (failure != 0 && error != nullptr) *error = std::string("send: ") + std::strerror(failure);
+  if (failure != 0 && error != nullptr) *error = sendFailure(failure).message;
   return failure == 0;
 }
 
@@ -66,10 +78,12 @@ UpcallClient::Outcome UpcallClient::receive(std::chrono::milliseconds timeout) {
       return outcome;
     }
   }
-  if (buffer_.empty()) buffer_.resize(kMaxReplySize);
+  // Left uninitialised: zero-filling it would touch every page of it, where
+  // a reply fills one.
+  if (!buffer_) buffer_ = std::make_unique_for_overwrite<std::uint8_t[]>(kMaxReplySize);
   ssize_t size = 0;
   do {
-    size = ::recv(fd_.get(), buffer_.data(), buffer_.size(), MSG_TRUNC);
+    size = ::recv(fd_.get(), buffer_.get(), kMaxReplySize, MSG_TRUNC);
   } while (size < 0 && errno == EINTR);
   if (size < 0 && errno != ECONNRESET) {
     outcome.message = std::string("recv: ") + std::strerror(errno);
@@ -80,26 +94,19 @@ UpcallClient::Outcome UpcallClient::receive(std::chrono::milliseconds timeout) {
     outcome.message = "the service closed the connection without a reply";
     return outcome;
   }
-  if (static_cast<std::size_t>(size) > buffer_.size()) {
+  if (static_cast<std::size_t>(size) > kMaxReplySize) {
     outcome.message = "a reply of " + std::to_string(size) + " bytes is too large";
     return outcome;
   }
   outcome.status = Status::Reply;
-  outcome.reply.assign(buffer_.begin(), buffer_.begin() + size);
+  outcome.reply.assign(buffer_.get(), buffer_.get() + size);
   return outcome;
 }
 
 UpcallClient::Outcome UpcallClient::call(std::span<const std::uint8_t> request,
                                          std::chrono::milliseconds timeout) {
   if (const int failure = sendDatagram(fd_.get(), request); failure != 0) {
-    Outcome outcome;
-    if (failure == EPIPE || failure == ECONNRESET) {
-      outcome.status = Status::Closed;
-      outcome.message = "the service closed the connection";
-    } else {
-      outcome.message = std::string("send: ") + std::strerror(failure);
-    }
-    return outcome;
+    return sendFailure(failure);
   }
   return receive(timeout);
 }

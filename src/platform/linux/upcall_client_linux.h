@@ -4,6 +4,7 @@
 
 #include <chrono>
 #include <cstdint>
+#include <memory>
 #include <optional>
 #include <span>
 #include <string>
@@ -38,14 +39,15 @@ class UpcallClient {
   // Sends one datagram and waits for one reply; a timeout of 0 waits for ever.
   Outcome call(std::span<const std::uint8_t> request,
                std::chrono::milliseconds timeout = std::chrono::milliseconds(0));
-  // The two halves, for callers that send several requests before reading.
+  // The two halves, for callers that send several requests before reading or
+  // work while the service answers; a failed send gives call's message.
   bool send(std::span<const std::uint8_t> request, std::string* error);
   Outcome receive(std::chrono::milliseconds timeout = std::chrono::milliseconds(0));
 
  private:
   explicit UpcallClient(UniqueFd fd) : fd_(std::move(fd)) {}
   UniqueFd fd_;
-  std::vector<std::uint8_t> buffer_;
+  std::unique_ptr<std::uint8_t[]> buffer_;  // room for the largest reply, made by the first receive
 };
 
 }  // namespace kestrel::platform
