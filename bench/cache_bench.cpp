@@ -9,10 +9,12 @@
 // cache cost what they cost in production (nothing is written).
 #include <benchmark/benchmark.h>
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <cstdio>
+#include <cstdlib>
 #include <filesystem>
 #include <string>
 #include <vector>
@@ -31,7 +33,18 @@ namespace fs = std::filesystem;
 
 constexpr std::uint32_t kUser = kKSTFirstMobileUserId;
 constexpr KSTContainerClass kClass = kKSTContainerClassDataApplication;
-constexpr std::size_t kContainerCount = 10000;
+// 10,000 containers; KESTREL_BENCH_CONTAINERS=100000 for the large store.
+const std::size_t kContainerCount = [] {
+  const char* count = std::getenv("KESTREL_BENCH_CONTAINERS");
+  return count != nullptr ? std::strtoull(count, nullptr, 10) : std::size_t{10000};
+}();
+
+// The process's peak resident set so far, in MiB.
+double peakResidentMiB() {
+  struct rusage usage {};
+  ::getrusage(RUSAGE_SELF, &usage);
+  return static_cast<double>(usage.ru_maxrss) / 1024.0;
+}
 
 struct Population {
   std::vector<std::string> metadataPaths;
@@ -45,8 +58,8 @@ Population& population() {
 }
 
 std::string identifierFor(std::size_t index) {
-  char buffer[32];
-  std::snprintf(buffer, sizeof buffer, "com.example.bench.%05zu", index);
+  char buffer[48];
+  std::snprintf(buffer, sizeof buffer, "com.example.bench.%06zu", index);
   return buffer;
 }
 
@@ -126,6 +139,7 @@ void BM_CacheRebuild(benchmark::State& state) {
     benchmark::DoNotOptimize(identifiers);
   }
   state.counters["containers"] = static_cast<double>(kContainerCount);
+  state.counters["peak_rss_mib"] = peakResidentMiB();
 }
 
 void BM_PlainReadMetadataFiles(benchmark::State& state) {
@@ -168,6 +182,8 @@ int main(int argc, char** argv) {
   kestrel::testing::FakeServices fakes;
   kestrel::Log::open("com.zorvane.kestreld", fakes.scratch.path() + "/log", kestrel::kLogNotice);
   if (!kestrel::populateClassDirectory()) return 1;
+  std::printf("peak resident set after making %zu containers: %.1f MiB\n", kestrel::kContainerCount,
+              kestrel::peakResidentMiB());
   benchmark::RunSpecifiedBenchmarks();
   benchmark::Shutdown();
   return 0;

@@ -60,10 +60,10 @@ class ReaderWriterLock {
   pthread_rwlock_t lock_;
 };
 
-// One identifier that is locked or waited for. Taken from the table's spares
-// when the first locker arrives and given back when the last one releases it,
-// so that the lock and unlock of an identifier nobody else holds allocate
-// nothing.
+// One identifier that is locked or waited for. Made when the first locker
+// arrives; when the last one releases it, it stays in the table, idle, for the
+// identifier's next locker (up to a bound), so that the lock and unlock of an
+// identifier nobody else holds allocate and copy nothing.
 struct KSTIdentifierLock {
   ReaderWriterLock lock;
   // Holders and waiters of this record; guarded by gKSTLocks.mutex.
@@ -78,8 +78,8 @@ struct KSTIdentifierLock {
   std::unique_ptr<KSTIdentifierLock> next;
 };
 
-// Identifier -> record: a chained hash table whose records keep their key's
-// storage when they go back to the spares. Guarded by gKSTLocks.mutex.
+// Identifier -> record: a chained hash table of live records (use count above
+// 0) and of idle ones kept for reuse. Guarded by gKSTLocks.mutex.
 class KSTIdentifierLockTable {
  public:
   // Eight bytes at a time, each word multiplied on its own and the products
@@ -130,45 +130,68 @@ class KSTIdentifierLockTable {
     if (buckets_.empty()) return nullptr;
     for (KSTIdentifierLock* record = buckets_[hash & (buckets_.size() - 1)].get();
          record != nullptr; record = record->next.get()) {
-      if (record->hash == hash && record->identifier == identifier) return record;
+      if (record->hash == hash && sameText(record->identifier, identifier)) return record;
     }
     return nullptr;
   }
 
-  KSTIdentifierLock& findOrInsert(std::string_view identifier, std::size_t hash) {
-    if (KSTIdentifierLock* found = find(identifier, hash)) return *found;
-    if (size_ + 1 > buckets_.size()) grow();
-    std::unique_ptr<KSTIdentifierLock> record;
-    if (spares_.empty()) {
-      record = std::make_unique<KSTIdentifierLock>();
-    } else {
-      record = std::move(spares_.back());
-      spares_.pop_back();
+  // Equality of two keys eight bytes at a time, inline (a UUID's text: four
+  // words and the last eight bytes).
+  static bool sameText(std::string_view a, std::string_view b) {
+    if (a.size() != b.size()) return false;
+    if (a.size() < 8) return a == b;
+    std::size_t at = 0;
+    for (; at + 8 <= a.size(); at += 8) {
+      std::uint64_t left;
+      std::uint64_t right;
+      std::memcpy(&left, a.data() + at, 8);
+      std::memcpy(&right, b.data() + at, 8);
+      if (left != right) return false;
     }
+    std::uint64_t left;
+    std::uint64_t right;
+    std::memcpy(&left, a.data() + a.size() - 8, 8);
+    std::memcpy(&right, b.data() + b.size() - 8, 8);
+    return left == right;
+  }
+
+  // The identifier's record, live from now on: found, or made.
+  KSTIdentifierLock& acquire(std::string_view identifier, std::size_t hash) {
+    if (KSTIdentifierLock* found = find(identifier, hash)) {
+      if (found->useCount == 0) --idle_;
+      return *found;
+    }
+    if (records_ + 1 > buckets_.size()) grow();
+    auto record = std::make_unique<KSTIdentifierLock>();
     record->identifier.assign(identifier);
     record->hash = hash;
     auto& head = buckets_[hash & (buckets_.size() - 1)];
     record->next = std::move(head);
     head = std::move(record);
-    ++size_;
+    ++records_;
     return *head;
   }
 
-  // Takes the record out of the table; it must be free and unused.
-  void erase(const KSTIdentifierLock& record) {
+  // The record's last user left (it is free and unused): it stays idle, or
+  // goes when enough others are idle already.
+  void release(const KSTIdentifierLock& record) {
+    if (idle_ < kMaxIdle) {
+      ++idle_;
+      return;
+    }
     std::unique_ptr<KSTIdentifierLock>* link = &buckets_[record.hash & (buckets_.size() - 1)];
     while (link->get() != &record) link = &(*link)->next;
     std::unique_ptr<KSTIdentifierLock> removed = std::move(*link);
     *link = std::move(removed->next);
-    --size_;
-    if (spares_.size() < kMaxSpares) spares_.push_back(std::move(removed));
+    --records_;
   }
 
-  std::size_t size() const { return size_; }
+  // Identifiers locked or waited for.
+  std::size_t liveCount() const { return records_ - idle_; }
 
  private:
-  // Enough for every request thread to hold a few identifiers at once.
-  static constexpr std::size_t kMaxSpares = 256;
+  // Enough for every request thread to come back to a few identifiers.
+  static constexpr std::size_t kMaxIdle = 256;
   static constexpr std::size_t kInitialBuckets = 64;
 
   void grow() {
@@ -187,8 +210,8 @@ class KSTIdentifierLockTable {
   }
 
   std::vector<std::unique_ptr<KSTIdentifierLock>> buckets_;  // a power of two long
-  std::vector<std::unique_ptr<KSTIdentifierLock>> spares_;
-  std::size_t size_ = 0;
+  std::size_t records_ = 0;
+  std::size_t idle_ = 0;
 };
 
 // A condition variable that counts its sleepers (under gKSTLocks.mutex), so
@@ -327,7 +350,7 @@ void take_one_lock(const std::string& identifier, bool forWriting) {
                 [] { return gKSTLocks.allReaderWriterState != -1; });
       ++gKSTLocks.identifierReaderCount;
     }
-    record = &gKSTLocks.identifierToLockMap.findOrInsert(identifier, hash);
+    record = &gKSTLocks.identifierToLockMap.acquire(identifier, hash);
     ++record->useCount;
   }
 
@@ -383,7 +406,7 @@ void unlock_one_lock(const std::string& identifier) {
   if (record.useCount == 0) {
     KSTLog(kLogDebug, "Destroying lock for identifier %@", identifier);
     KST_INVARIANT(record.lockState.load() == 0);
-    map.erase(record);
+    map.release(record);
   }
 }
 
@@ -487,7 +510,7 @@ void unlock_all_identifiers() {
 
 std::size_t KSTLocksLiveRecordCount() {
   std::lock_guard lock(gKSTLocks.mutex);
-  return gKSTLocks.identifierToLockMap.size();
+  return gKSTLocks.identifierToLockMap.liveCount();
 }
 
 // ---- Guards

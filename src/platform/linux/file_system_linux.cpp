@@ -640,6 +640,13 @@ int readWholeFile(const char* path, std::size_t maxSize, std::vector<std::uint8_
       return EFBIG;
     }
     contents->insert(contents->end(), buffer, buffer + n);
+    // All the bytes the file had when it was opened, read by a short read: its
+    // end (a file written in place would be replaced, never grown), without
+    // one more read to see it.
+    if (static_cast<std::size_t>(n) < sizeof buffer &&
+        contents->size() == static_cast<std::size_t>(st.st_size)) {
+      break;
+    }
   }
   return 0;
 }
