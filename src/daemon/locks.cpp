@@ -371,7 +371,8 @@ void unlock_one_lock(const std::string& identifier) {
   std::unique_lock lock = lockStateMutex();
   KSTIdentifierLockTable& map = gKSTLocks.identifierToLockMap;
   KSTIdentifierLock* found = map.find(identifier, hash);
-  KST_INVARIANT(found != nullptr);
+  // An idle record is one nobody holds.
+  KST_INVARIANT(found != nullptr && found->useCount > 0);
   KSTIdentifierLock& record = *found;
   KST_INVARIANT(record.lockState.load() != 0);
 
