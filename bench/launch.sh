@@ -14,22 +14,12 @@
 #
 #   bench/launch.sh [rounds]      # default 200 of each
 set -euo pipefail
-here="$(cd "$(dirname "${BASH_SOURCE[0]}")" && pwd)"
-source_dir="$(dirname "$here")"
-build_dir="$source_dir/build/bench"
+source "$(dirname "${BASH_SOURCE[0]}")/daemon-root.sh"
 rounds="${1:-200}"
-"$source_dir/scripts/setup.sh"
 
-cmake -S "$source_dir" -B "$build_dir" -G Ninja -DCMAKE_BUILD_TYPE=RelWithDebInfo \
-  -DKESTREL_BUILD_BENCHMARKS=ON -DKESTREL_BUILD_TESTS=OFF >/dev/null
-cmake --build "$build_dir" --target kestreld kestrelctl kestrel-run kestrel_launch_bench \
-  kestrel_launch_stamp -j2
-
-root="$("$source_dir/tools/make-scratch-root.sh")"
-KESTREL_ROOT="$root" "$build_dir/kestreld" 2>/dev/null &
-pid=$!
-trap 'kill -TERM $pid 2>/dev/null || true; wait $pid 2>/dev/null || true; KESTRELCTL="$build_dir/tools/kestrelctl" "$source_dir/tools/remove-scratch-root.sh" "$root"' EXIT
-for _ in $(seq 200); do [[ -S "$root/run/kestrel/com.zorvane.kestreld.upcall" ]] && break; sleep 0.05; done
+bench_build kestrel-run kestrel_launch_bench kestrel_launch_stamp
+bench_make_root
+bench_start_daemon
 
 out="$here/results/launch-$(date -u +%Y%m%dT%H%M%SZ)"
 mkdir -p "$out"
