@@ -130,29 +130,9 @@ class KSTIdentifierLockTable {
     if (buckets_.empty()) return nullptr;
     for (KSTIdentifierLock* record = buckets_[hash & (buckets_.size() - 1)].get();
          record != nullptr; record = record->next.get()) {
-      if (record->hash == hash && sameText(record->identifier, identifier)) return record;
+      if (record->hash == hash && record->identifier == identifier) return record;
     }
     return nullptr;
-  }
-
-  // Equality of two keys eight bytes at a time, inline (a UUID's text: four
-  // words and the last eight bytes).
-  static bool sameText(std::string_view a, std::string_view b) {
-    if (a.size() != b.size()) return false;
-    if (a.size() < 8) return a == b;
-    std::size_t at = 0;
-    for (; at + 8 <= a.size(); at += 8) {
-      std::uint64_t left;
-      std::uint64_t right;
-      std::memcpy(&left, a.data() + at, 8);
-      std::memcpy(&right, b.data() + at, 8);
-      if (left != right) return false;
-    }
-    std::uint64_t left;
-    std::uint64_t right;
-    std::memcpy(&left, a.data() + a.size() - 8, 8);
-    std::memcpy(&right, b.data() + b.size() - 8, 8);
-    return left == right;
   }
 
   // The identifier's record, live from now on: found, or made.
