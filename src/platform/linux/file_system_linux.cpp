@@ -16,7 +16,6 @@
 #include <cstring>
 #include <memory>
 #include <mutex>
-#include <optional>
 #include <string>
 #include <vector>
 
@@ -151,7 +150,11 @@ class DescriptorTreeRemover {
     if (!directory) {
       const int openError = errno;
       if (openError == ENOENT) return 0;
-      if (openError == ENOTDIR || openError == ELOOP) return removeFile(parent, name, true);
+      if (openError == ENOTDIR || openError == ELOOP) {
+        // No directory (any more): path_ names the item already.
+        if (::unlinkat(parent, name, 0) == 0 || errno == ENOENT) return 0;
+        return report(errno);
+      }
       // Its contents cannot be listed: it goes only when it is empty.
       if (::unlinkat(parent, name, AT_REMOVEDIR) == 0) return 0;
       return report(openError);
@@ -176,12 +179,10 @@ class DescriptorTreeRemover {
     }
   }
 
-  // `named`: path_ names the item already.
-  int removeFile(int parent, const char* name, bool named = false) {
-    std::optional<PathPart> part;
-    if (!named) part.emplace(path_, name, false);
-    if (::unlinkat(parent, name, 0) == 0 || errno == ENOENT) return 0;
-    return report(errno);
+  // Reports a failure of the entry `name` of the directory being emptied.
+  int reportEntry(const char* name, int error) {
+    PathPart part(path_, name, false);
+    return report(error);
   }
 
   int removeContents(int directory, int depth) {
@@ -213,16 +214,14 @@ class DescriptorTreeRemover {
     if (type == DT_UNKNOWN) {
       struct stat info {};
       if (::fstatat(directory, name, &info, AT_SYMLINK_NOFOLLOW) != 0) {
-        if (errno == ENOENT) return 0;
-        PathPart part(path_, name, false);
-        return report(errno);
+        return errno == ENOENT ? 0 : reportEntry(name, errno);
       }
       type = S_ISDIR(info.st_mode) ? DT_DIR : DT_REG;
     }
     if (type != DT_DIR) {
       if (::unlinkat(directory, name, 0) == 0 || errno == ENOENT) return 0;
-      // Replaced by a directory since it was listed.
-      if (errno != EISDIR && errno != EPERM) return removeFile(directory, name);
+      // EISDIR: replaced by a directory since it was listed.
+      if (errno != EISDIR) return reportEntry(name, errno);
     }
     return removeDirectory(directory, name, depth + 1);
   }
