@@ -10,26 +10,20 @@
 #include <memory>
 #include <string_view>
 
+#include "platform/binary_plist_format.h"
+#include "platform/binary_plist_reader.h"
+
 namespace kestrel::platform {
 
 namespace {
 
-constexpr std::string_view kBinaryMagic = "bplist00";
-constexpr std::size_t kTrailerSize = 32;
-constexpr std::uint64_t kInt64Max =
-    static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max());
-
-// Binary object markers (high nibble: kind, low nibble: size or count).
-constexpr std::uint8_t kMarkerInteger = 0x10;
-constexpr std::uint8_t kMarkerInteger16Bytes = 0x14;
-constexpr std::uint8_t kMarkerDate = 0x33;
-constexpr std::uint8_t kKindAsciiString = 0x5;
-constexpr std::uint8_t kKindUnicodeString = 0x6;
-constexpr std::uint8_t kKindArray = 0xA;
-constexpr std::uint8_t kKindOrderedSet = 0xB;
-constexpr std::uint8_t kKindSet = 0xC;
-constexpr std::uint8_t kKindDictionary = 0xD;
-constexpr std::uint8_t kCountFollows = 0xF;
+using bplist::appendBigEndian;
+using bplist::kInt64Max;
+using bplist::kMarkerDate;
+using bplist::kMarkerInteger16Bytes;
+using bplist::kTrailerSize;
+using bplist::readBigEndian;
+constexpr std::string_view kBinaryMagic = bplist::kMagic;
 
 // --- Ownership of what libplist hands out -------------------------------------------------
 
@@ -54,16 +48,6 @@ template <typename T>
 std::optional<T> fail(std::string* error, std::string reason) {
   if (error != nullptr) *error = std::move(reason);
   return std::nullopt;
-}
-
-std::uint64_t readBigEndian(const std::uint8_t* p, std::size_t size) {
-  std::uint64_t value = 0;
-  for (std::size_t i = 0; i < size; ++i) value = (value << 8) | p[i];
-  return value;
-}
-
-void appendBigEndian(std::vector<std::uint8_t>& out, std::uint64_t value, std::size_t size) {
-  for (std::size_t i = size; i-- > 0;) out.push_back(static_cast<std::uint8_t>(value >> (8 * i)));
 }
 
 bool isValidUtf8(std::string_view s) {
@@ -102,243 +86,7 @@ bool isValidUtf8(std::string_view s) {
   return true;
 }
 
-// --- Checks made before libplist sees the bytes --------------------------------------------
-
-// Walks the object graph of a binary property list without building it: the
-// trailer and offset table must be consistent, every reference must name an
-// object, the graph must have no cycle and its nesting must stay within
-// kMaxPropertyListDepth. libplist's own parser recurses once per level and
-// would exhaust the stack on a deep enough input.
-class BinaryStructureCheck {
- public:
-  explicit BinaryStructureCheck(std::span<const std::uint8_t> bytes) : bytes_(bytes) {}
-
-  bool run(std::string* error) { return readTrailer(error) && checkGraph(error); }
-
- private:
-  struct Object {
-    bool container = false;
-    std::uint64_t refsStart = 0;
-    std::uint64_t refCount = 0;
-  };
-
-  bool failWith(std::string* error, const char* reason) {
-    if (error != nullptr) *error = reason;
-    return false;
-  }
-
-  bool readTrailer(std::string* error) {
-    if (bytes_.size() < kBinaryMagic.size() + 1 + 1 + kTrailerSize) {
-      return failWith(error, "binary property list is truncated");
-    }
-    const std::uint8_t* trailer = bytes_.data() + bytes_.size() - kTrailerSize;
-    offsetSize_ = trailer[6];
-    refSize_ = trailer[7];
-    objectCount_ = readBigEndian(trailer + 8, 8);
-    topObject_ = readBigEndian(trailer + 16, 8);
-    const std::uint64_t tableOffset = readBigEndian(trailer + 24, 8);
-    const std::uint64_t trailerOffset = bytes_.size() - kTrailerSize;
-    if (offsetSize_ < 1 || offsetSize_ > 8 || refSize_ < 1 || refSize_ > 8) {
-      return failWith(error, "binary property list has an invalid trailer");
-    }
-    if (objectCount_ == 0 || objectCount_ > kMaxPropertyListObjects) {
-      return failWith(error, "binary property list has too many or no objects");
-    }
-    if (topObject_ >= objectCount_ || tableOffset <= kBinaryMagic.size() ||
-        tableOffset > trailerOffset || objectCount_ > (trailerOffset - tableOffset) / offsetSize_) {
-      return failWith(error, "binary property list has an invalid offset table");
-    }
-    objectsEnd_ = tableOffset;
-    offsets_.resize(objectCount_);
-    for (std::uint64_t i = 0; i < objectCount_; ++i) {
-      const std::uint64_t offset =
-          readBigEndian(bytes_.data() + tableOffset + i * offsetSize_, offsetSize_);
-      if (offset < kBinaryMagic.size() || offset >= objectsEnd_) {
-        return failWith(error, "binary property list has an object offset out of range");
-      }
-      offsets_[i] = offset;
-    }
-    keyChecked_.assign(objectCount_, false);
-    return true;
-  }
-
-  // Reads an object's header: whether it holds references, and where they are.
-  bool inspect(std::uint64_t ref, Object* object, std::string* error) {
-    const std::uint64_t offset = offsets_[ref];
-    const std::uint8_t marker = bytes_[offset];
-    const std::uint8_t kind = marker >> 4;
-    const std::uint8_t info = marker & 0x0F;
-    *object = Object{};
-    if (kind == (kMarkerInteger >> 4)) {
-      if (info > 4) return failWith(error, "binary property list has an integer of unknown size");
-      const std::uint64_t size = std::uint64_t{1} << info;
-      if (objectsEnd_ - offset - 1 < size)
-        return failWith(error, "binary property list is truncated");
-      // Sixteen-byte integers carry values above INT64_MAX; anything wider does not fit.
-      if (size == 16 && readBigEndian(bytes_.data() + offset + 1, 8) != 0) {
-        return failWith(error, "binary property list has an integer out of range");
-      }
-      return true;
-    }
-    if (kind != kKindArray && kind != kKindOrderedSet && kind != kKindSet &&
-        kind != kKindDictionary) {
-      return true;  // A scalar; libplist checks its payload.
-    }
-    std::uint64_t count = 0;
-    std::uint64_t refsStart = 0;
-    if (!readCount(offset, &count, &refsStart, error)) return false;
-    const std::uint64_t perEntry = kind == kKindDictionary ? 2 : 1;
-    const std::uint64_t room = (objectsEnd_ - refsStart) / refSize_;
-    if (count > room / perEntry) return failWith(error, "binary property list is truncated");
-    object->container = true;
-    object->refsStart = refsStart;
-    object->refCount = count * perEntry;
-    if (kind == kKindDictionary) {
-      // Keys come first, then the values.
-      for (std::uint64_t i = 0; i < count; ++i) {
-        if (!checkKey(refAt(*object, i), error)) return false;
-      }
-    }
-    return true;
-  }
-
-  // The number in the low nibble of the object's marker, or the integer object
-  // that follows the marker when the nibble is 0xF; *start is where the
-  // object's contents begin.
-  bool readCount(std::uint64_t offset, std::uint64_t* count, std::uint64_t* start,
-                 std::string* error) {
-    const std::uint8_t info = bytes_[offset] & 0x0F;
-    if (info != kCountFollows) {
-      *count = info;
-      *start = offset + 1;
-      return true;
-    }
-    if (objectsEnd_ - offset < 2) return failWith(error, "binary property list is truncated");
-    const std::uint8_t countMarker = bytes_[offset + 1];
-    if ((countMarker & 0xF0) != kMarkerInteger || (countMarker & 0x0F) > 3) {
-      return failWith(error, "binary property list has an invalid object count");
-    }
-    const std::uint64_t countSize = std::uint64_t{1} << (countMarker & 0x0F);
-    if (objectsEnd_ - offset - 2 < countSize) {
-      return failWith(error, "binary property list is truncated");
-    }
-    *count = readBigEndian(bytes_.data() + offset + 2, countSize);
-    *start = offset + 2 + countSize;
-    return true;
-  }
-
-  // libplist cannot hand out a dictionary key holding a NUL character (it
-  // stops the process on an assertion), so such keys are refused here. Keys
-  // of other kinds than strings are refused by libplist itself.
-  bool checkKey(std::uint64_t ref, std::string* error) {
-    if (ref >= objectCount_) {
-      return failWith(error, "binary property list has a reference out of range");
-    }
-    if (keyChecked_[ref]) return true;
-    const std::uint64_t offset = offsets_[ref];
-    const std::uint8_t kind = bytes_[offset] >> 4;
-    if (kind == kKindAsciiString || kind == kKindUnicodeString) {
-      std::uint64_t length = 0;
-      std::uint64_t start = 0;
-      if (!readCount(offset, &length, &start, error)) return false;
-      const std::uint64_t unit = kind == kKindAsciiString ? 1 : 2;
-      if (length > (objectsEnd_ - start) / unit) {
-        return failWith(error, "binary property list is truncated");
-      }
-      for (std::uint64_t i = 0; i < length; ++i) {
-        const std::uint8_t* character = bytes_.data() + start + i * unit;
-        if (character[0] == 0 && (unit == 1 || character[1] == 0)) {
-          return failWith(error, "property list dictionary key holds a NUL character");
-        }
-      }
-    }
-    keyChecked_[ref] = true;
-    return true;
-  }
-
-  std::uint64_t refAt(const Object& object, std::uint64_t index) const {
-    return readBigEndian(bytes_.data() + object.refsStart + index * refSize_, refSize_);
-  }
-
-  // Depth-first over the graph with an explicit stack. Each object is examined
-  // once and remembers the height of the nesting below it and the number of
-  // nodes it stands for once libplist has copied every shared subtree out (an
-  // object referenced twice is built twice), so that a graph which is small on
-  // disk but huge as a tree is refused as well.
-  bool checkGraph(std::string* error) {
-    enum : std::uint8_t { kNew, kOnPath, kDone };
-    struct Frame {
-      std::uint64_t ref;
-      Object object;
-      std::uint64_t next = 0;
-      std::uint16_t tallestChild = 0;
-      std::uint64_t nodes = 1;
-    };
-    constexpr std::uint64_t kNodeLimit = kMaxPropertyListObjects;
-    std::vector<std::uint8_t> state(objectCount_, kNew);
-    std::vector<std::uint16_t> height(objectCount_, 0);
-    std::vector<std::uint32_t> nodes(objectCount_, 1);
-    std::vector<Frame> path;
-
-    Object top;
-    if (!inspect(topObject_, &top, error)) return false;
-    if (!top.container) return true;
-    path.push_back(Frame{topObject_, top});
-    state[topObject_] = kOnPath;
-    while (!path.empty()) {
-      Frame& frame = path.back();
-      if (frame.nodes > kNodeLimit) return failWith(error, "property list has too many objects");
-      if (frame.next < frame.object.refCount) {
-        const std::uint64_t child = refAt(frame.object, frame.next++);
-        if (child >= objectCount_) {
-          return failWith(error, "binary property list has a reference out of range");
-        }
-        if (state[child] == kOnPath) return failWith(error, "binary property list has a cycle");
-        if (state[child] == kDone) {
-          if (path.size() + height[child] > static_cast<std::size_t>(kMaxPropertyListDepth)) {
-            return failWith(error, "property list is nested too deeply");
-          }
-          frame.tallestChild = std::max(frame.tallestChild, height[child]);
-          frame.nodes += nodes[child];
-          continue;
-        }
-        Object object;
-        if (!inspect(child, &object, error)) return false;
-        if (!object.container) {
-          state[child] = kDone;
-          frame.nodes += 1;
-          continue;
-        }
-        if (path.size() + 1 > static_cast<std::size_t>(kMaxPropertyListDepth)) {
-          return failWith(error, "property list is nested too deeply");
-        }
-        state[child] = kOnPath;
-        path.push_back(Frame{child, object});
-        continue;
-      }
-      const auto finishedHeight = static_cast<std::uint16_t>(frame.tallestChild + 1);
-      const auto finishedNodes = static_cast<std::uint32_t>(frame.nodes);  // <= kNodeLimit
-      state[frame.ref] = kDone;
-      height[frame.ref] = finishedHeight;
-      nodes[frame.ref] = finishedNodes;
-      path.pop_back();
-      if (!path.empty()) {
-        path.back().tallestChild = std::max(path.back().tallestChild, finishedHeight);
-        path.back().nodes += finishedNodes;
-      }
-    }
-    return true;
-  }
-
-  std::span<const std::uint8_t> bytes_;
-  std::uint8_t offsetSize_ = 0;
-  std::uint8_t refSize_ = 0;
-  std::uint64_t objectCount_ = 0;
-  std::uint64_t topObject_ = 0;
-  std::uint64_t objectsEnd_ = 0;
-  std::vector<std::uint64_t> offsets_;
-  std::vector<bool> keyChecked_;
-};
+// --- Checks made before libplist sees XML ------------------------------------------------
 
 // Counts the nesting of <array> and <dict> elements and the number of elements
 // of an XML property list. It errs on the side of counting too much: an array
@@ -635,15 +383,13 @@ std::optional<PlistValue> parsePropertyList(std::span<const std::uint8_t> bytes,
   }
   const char* raw = reinterpret_cast<const char*>(bytes.data());
   const auto length = static_cast<std::uint32_t>(bytes.size());
-  plist_t root = nullptr;
   if (bytes.size() >= kBinaryMagic.size() &&
       std::memcmp(raw, kBinaryMagic.data(), kBinaryMagic.size()) == 0) {
-    if (!BinaryStructureCheck(bytes).run(error)) return std::nullopt;
-    plist_from_bin(raw, length, &root);
-  } else {
-    if (!checkXmlStructure(std::string_view(raw, bytes.size()), error)) return std::nullopt;
-    plist_from_xml(raw, length, &root);
+    return readBinaryPropertyList(bytes, error);
   }
+  if (!checkXmlStructure(std::string_view(raw, bytes.size()), error)) return std::nullopt;
+  plist_t root = nullptr;
+  plist_from_xml(raw, length, &root);
   const UniquePlist owner(root);
   if (root == nullptr)
     return fail<PlistValue>(error, "data is not a property list libplist can read");

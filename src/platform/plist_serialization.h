@@ -1,11 +1,11 @@
-// Property-list serialisation: bytes of any format libplist reads (binary
-// "bplist00", XML) become a PlistValue, and a PlistValue becomes a binary
-// property list, format version 1.0.
+// Property-list serialisation: bytes of a binary ("bplist00") or XML property
+// list become a PlistValue, and a PlistValue becomes a binary property list,
+// format version 1.0.
 //
 // Input is treated as hostile: it may come from a file that someone else could
-// replace. It is checked for size, nesting depth, object count and structural
-// sanity before libplist sees it, and anything unexpected is an error, never a
-// crash.
+// replace. Binary input is read by our own reader (binary_plist_reader.h); XML
+// is checked for size, nesting depth and element count before libplist sees it.
+// Anything unexpected is an error, never a crash.
 //
 // What the binary format can hold decides what comes back from a round trip:
 //   - an unsigned integer that fits in a signed one reads back as a signed

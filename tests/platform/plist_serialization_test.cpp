@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <limits>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -151,6 +152,38 @@ TEST(PlistSerializationTest, InputBeyondTheLimitsIsRefused) {
   // One level less is still read.
   EXPECT_TRUE(parsePropertyList(nestedArrays(kMaxPropertyListDepth, 1), nullptr));
   EXPECT_TRUE(parsePropertyList(bytesOf(nestedXml(kMaxPropertyListDepth)), nullptr));
+}
+
+// Objects our own writer never produces, as other writers may.
+TEST(PlistSerializationTest, ReadsBinaryObjectsOfOtherWriters) {
+  const struct {
+    const char* name;
+    Bytes input;
+    std::optional<PlistValue> value;
+    std::string reason;
+  } rows[] = {
+      {"UTF-16 with a surrogate pair",
+       binaryPlist({Bytes{0x63, 0x00, 0x41, 0xD8, 0x3D, 0xDE, 0x00}}),
+       PlistValue("A\xF0\x9F\x98\x80"), ""},
+      {"four-byte real", binaryPlist({Bytes{0x22, 0x3F, 0xC0, 0x00, 0x00}}), PlistValue(1.5), ""},
+      {"set", binaryPlist({Bytes{0xC1, 0x00, 0x01}, Bytes{0x10, 0x07}}), PlistArray{7}, ""},
+      {"lone surrogate", binaryPlist({Bytes{0x61, 0xD8, 0x3D}}), std::nullopt, "not UTF-16"},
+      {"NUL in a string", binaryPlist({Bytes{0x53, 'a', 0, 'b'}}), std::nullopt, "NUL"},
+      {"integer key", binaryPlist({Bytes{0xD1, 0x00, 0x01, 0x00, 0x01}, Bytes{0x10, 0x07}}),
+       std::nullopt, "not a string"},
+      {"null object", binaryPlist({Bytes{0x00}}), std::nullopt, "unsupported"},
+      {"string beyond the objects", binaryPlist({Bytes{0x5F, 0x10, 0x40, 'a'}}), std::nullopt,
+       "truncated"},
+  };
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.name);
+    std::string error;
+    const std::optional<PlistValue> value = parsePropertyList(row.input, &error);
+    EXPECT_EQ(value, row.value) << error;
+    if (!row.value) {
+      EXPECT_NE(error.find(row.reason), std::string::npos) << error;
+    }
+  }
 }
 
 TEST(PlistSerializationTest, ValuesTheFormatCannotHoldAreRefused) {
