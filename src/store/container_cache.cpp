@@ -1,5 +1,6 @@
 #include "store/container_cache.h"
 
+#include <algorithm>
 #include <cerrno>
 
 #include "daemon/exceptions.h"
@@ -70,6 +71,17 @@ std::string classMapKey(std::uint32_t user, KSTContainerClass contentClass) {
   return key;
 }
 
+// The map's entries in identifier order, the order every listing answers in.
+std::vector<const KSTContainerCache::ClassMap::value_type*> sortedEntries(
+    const KSTContainerCache::ClassMap& classMap) {
+  std::vector<const KSTContainerCache::ClassMap::value_type*> entries;
+  entries.reserve(classMap.size());
+  for (const auto& entry : classMap) entries.push_back(&entry);
+  std::sort(entries.begin(), entries.end(),
+            [](const auto* a, const auto* b) { return a->first < b->first; });
+  return entries;
+}
+
 }  // namespace
 
 KSTContainerCache& KSTContainerCache::sharedInstance() {
@@ -111,6 +123,7 @@ KSTContainerCache::ClassMap* KSTContainerCache::_getCacheForUserId(std::uint32_t
   }
 
   ClassMap classMap;
+  classMap.reserve(urls->size());
   for (const KSTFileURL& url : *urls) {
     // Only a directory can be a container; links are not followed out of the
     // class directory.
@@ -231,8 +244,9 @@ std::optional<std::vector<KSTMetadataRef>> KSTContainerCache::allContainersForUs
       std::lock_guard guard(cacheLock_);
       ClassMap* classMap = classMapOrRebuildError(function, user, contentClass, transient, error);
       if (classMap == nullptr) return std::nullopt;
-      snapshot.reserve(classMap->size());
-      for (const auto& [identifier, record] : *classMap) snapshot.push_back(record);
+      const std::vector<const ClassMap::value_type*> entries = sortedEntries(*classMap);
+      snapshot.reserve(entries.size());
+      for (const ClassMap::value_type* entry : entries) snapshot.push_back(entry->second);
     }
 
     const std::string_view classPath = KSTContainerClassPath(contentClass);
@@ -274,9 +288,10 @@ std::optional<std::vector<std::string>> KSTContainerCache::allContainerIdentifie
     std::lock_guard guard(cacheLock_);
     ClassMap* classMap = classMapOrRebuildError(function, user, contentClass, transient, error);
     if (classMap == nullptr) return std::nullopt;
+    const std::vector<const ClassMap::value_type*> entries = sortedEntries(*classMap);
     std::vector<std::string> identifiers;
-    identifiers.reserve(classMap->size());
-    for (const auto& entry : *classMap) identifiers.push_back(entry.first);
+    identifiers.reserve(entries.size());
+    for (const ClassMap::value_type* entry : entries) identifiers.push_back(entry->first);
     return identifiers;
   });
 }

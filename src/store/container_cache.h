@@ -17,7 +17,6 @@
 #pragma once
 
 #include <cstdint>
-#include <map>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -35,8 +34,17 @@ namespace kestrel {
 
 class KSTContainerCache {
  public:
-  // Identifier -> record, for one (user, class, transient) triple.
-  using ClassMap = std::map<std::string, KSTMetadataRef, std::less<>>;
+  // Looks identifiers up by string_view as well as by string.
+  struct IdentifierHash {
+    using is_transparent = void;
+    std::size_t operator()(std::string_view identifier) const noexcept {
+      return std::hash<std::string_view>{}(identifier);
+    }
+  };
+  // Identifier -> record, for one (user, class, transient) triple. Hashed, not
+  // ordered: a rebuild inserts thousands of records and a lookup finds one, and
+  // both were dominated by the string comparisons of a tree. Listings sort.
+  using ClassMap = std::unordered_map<std::string, KSTMetadataRef, IdentifierHash, std::equal_to<>>;
 
   static KSTContainerCache& sharedInstance();
 
