@@ -105,7 +105,6 @@ class BinaryPropertyListReader {
       }
       offsets_[i] = offset;
     }
-    keyChecked_.assign(objectCount_, false);
     return true;
   }
 
@@ -139,13 +138,7 @@ class BinaryPropertyListReader {
     if (count > room / perEntry) return failWith(error, "binary property list is truncated");
     object->container = true;
     object->refsStart = refsStart;
-    object->refCount = count * perEntry;
-    if (kind == bplist::kKindDictionary) {
-      // Keys come first, then the values.
-      for (std::uint64_t i = 0; i < count; ++i) {
-        if (!checkKey(refAt(*object, i), error)) return false;
-      }
-    }
+    object->refCount = count * perEntry;  // a dictionary's keys first, then its values
     return true;
   }
 
@@ -171,35 +164,6 @@ class BinaryPropertyListReader {
     }
     *count = bplist::readBigEndian(bytes_.data() + offset + 2, countSize);
     *start = offset + 2 + countSize;
-    return true;
-  }
-
-  // A dictionary key holding a NUL character could not be written back, so
-  // such keys are refused here; keys of other kinds than strings are refused
-  // when the dictionary is read.
-  bool checkKey(std::uint64_t ref, std::string* error) {
-    if (ref >= objectCount_) {
-      return failWith(error, "binary property list has a reference out of range");
-    }
-    if (keyChecked_[ref]) return true;
-    const std::uint64_t offset = offsets_[ref];
-    const std::uint8_t kind = bytes_[offset] >> 4;
-    if (kind == bplist::kKindAsciiString || kind == bplist::kKindUnicodeString) {
-      std::uint64_t length = 0;
-      std::uint64_t start = 0;
-      if (!readCount(offset, &length, &start, error)) return false;
-      const std::uint64_t unit = kind == bplist::kKindAsciiString ? 1 : 2;
-      if (length > (objectsEnd_ - start) / unit) {
-        return failWith(error, "binary property list is truncated");
-      }
-      for (std::uint64_t i = 0; i < length; ++i) {
-        const std::uint8_t* character = bytes_.data() + start + i * unit;
-        if (character[0] == 0 && (unit == 1 || character[1] == 0)) {
-          return failWith(error, "property list dictionary key holds a NUL character");
-        }
-      }
-    }
-    keyChecked_[ref] = true;
     return true;
   }
 
@@ -422,7 +386,6 @@ class BinaryPropertyListReader {
   std::uint64_t topObject_ = 0;
   std::uint64_t objectsEnd_ = 0;
   std::vector<std::uint64_t> offsets_;
-  std::vector<bool> keyChecked_;
 };
 
 }  // namespace
