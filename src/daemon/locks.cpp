@@ -24,10 +24,77 @@ namespace kestrel {
 
 namespace {
 
+// Every lock here is held for a short while by requests that run on other
+// cores, and a thread put to sleep on this virtual machine takes tens of
+// microseconds to wake: so a locker that finds a lock taken tries again for a
+// few microseconds before it sleeps.
+constexpr auto kSpinBeforeSleeping = std::chrono::microseconds(20);
+
+void cpuRelax() {
+#if defined(__x86_64__) || defined(__i386__)
+  __builtin_ia32_pause();
+#else
+  std::this_thread::yield();
+#endif
+}
+
+// Calls `attempt` until it succeeds or the spin time is over.
+template <typename Attempt>
+bool spinFor(Attempt attempt) {
+  if (attempt()) return true;
+  const auto deadline = std::chrono::steady_clock::now() + kSpinBeforeSleeping;
+  do {
+    for (int i = 0; i < 32; ++i) cpuRelax();
+    if (attempt()) return true;
+  } while (std::chrono::steady_clock::now() < deadline);
+  return false;
+}
+
+// The mutex of the lock state. Free, it is taken and released with one atomic
+// instruction each, inline; a locker that finds it held spins for a while,
+// then sleeps on its word.
+class KSTStateMutex {
+ public:
+  void lock() {
+    if (!try_lock()) [[unlikely]] {
+      lockContended();
+    }
+  }
+  bool try_lock() {
+    std::uint32_t expected = kFree;
+    return word_.compare_exchange_strong(expected, kHeld, std::memory_order_acquire,
+                                         std::memory_order_relaxed);
+  }
+  // Sequentially consistent, as is the sleeper's registering itself before it
+  // sleeps: notify_one wakes nobody when it sees no sleeper registered.
+  void unlock() {
+    if (word_.exchange(kFree) == kHeldWithSleepers) [[unlikely]] {
+      word_.notify_one();
+    }
+  }
+
+ private:
+  static constexpr std::uint32_t kFree = 0;
+  static constexpr std::uint32_t kHeld = 1;
+  // Held, and a locker may sleep on the word: its release wakes one.
+  static constexpr std::uint32_t kHeldWithSleepers = 2;
+
+  [[gnu::noinline]] void lockContended() {
+    if (spinFor([this] { return word_.load(std::memory_order_relaxed) == kFree && try_lock(); })) {
+      return;
+    }
+    while (word_.exchange(kHeldWithSleepers, std::memory_order_acquire) != kFree) {
+      word_.wait(kHeldWithSleepers);
+    }
+  }
+
+  std::atomic<std::uint32_t> word_{kFree};
+};
+
 // A condition variable that counts its sleepers (under gKSTLocks.mutex), so
 // that signalling nobody costs nothing.
 struct KSTLockCondition {
-  std::condition_variable variable;
+  std::condition_variable_any variable;
   std::uint32_t sleepers = 0;
 
   void notify_one() {
@@ -187,7 +254,7 @@ class KSTIdentifierLockTable {
 // It is always taken alone, and never held while waiting: waiters sleep on a
 // condition, which releases it.
 struct KSTLocksState {
-  std::mutex mutex;
+  KSTStateMutex mutex;
   KSTLockCondition allWritersCondition;
   KSTLockCondition allReadersCondition;
   KSTLockCondition identifierWritersCondition;
@@ -204,43 +271,11 @@ struct KSTLocksState {
 
 KSTLocksState gKSTLocks;
 
-// Every lock here is held for a short while by requests that run on other
-// cores, and a thread put to sleep on this virtual machine takes tens of
-// microseconds to wake: so a locker that finds a lock taken tries again for a
-// few microseconds before it sleeps.
-constexpr auto kSpinBeforeSleeping = std::chrono::microseconds(20);
-
-void cpuRelax() {
-#if defined(__x86_64__) || defined(__i386__)
-  __builtin_ia32_pause();
-#else
-  std::this_thread::yield();
-#endif
-}
-
-// Calls `attempt` until it succeeds or the spin time is over.
-template <typename Attempt>
-bool spinFor(Attempt attempt) {
-  if (attempt()) return true;
-  const auto deadline = std::chrono::steady_clock::now() + kSpinBeforeSleeping;
-  do {
-    for (int i = 0; i < 32; ++i) cpuRelax();
-    if (attempt()) return true;
-  } while (std::chrono::steady_clock::now() < deadline);
-  return false;
-}
-
-std::unique_lock<std::mutex> lockStateMutex() {
-  std::unique_lock lock(gKSTLocks.mutex, std::defer_lock);
-  if (!spinFor([&] { return lock.try_lock(); })) lock.lock();
-  return lock;
-}
-
 // Called with `lock` released, returns with it held and `ready()` true: tries
 // for a while, then sleeps on the condition. `mayBeReady`, called without the
 // mutex, spares the mutex the tries that cannot succeed.
 template <typename Ready, typename MayBeReady>
-void lockWhen(std::unique_lock<std::mutex>& lock, KSTLockCondition& condition, Ready ready,
+void lockWhen(std::unique_lock<KSTStateMutex>& lock, KSTLockCondition& condition, Ready ready,
               MayBeReady mayBeReady) {
   spinFor([&] {
     if (!mayBeReady() || !lock.try_lock()) return false;
@@ -256,7 +291,7 @@ void lockWhen(std::unique_lock<std::mutex>& lock, KSTLockCondition& condition, R
 
 // Returns with `lock` still held and `ready()` true.
 template <typename Ready>
-void waitUntil(std::unique_lock<std::mutex>& lock, KSTLockCondition& condition, Ready ready) {
+void waitUntil(std::unique_lock<KSTStateMutex>& lock, KSTLockCondition& condition, Ready ready) {
   if (ready()) return;
   lock.unlock();
   lockWhen(lock, condition, ready, [] { return true; });
@@ -313,7 +348,7 @@ void enter(KSTIdentifierLock& record, bool forWriting) {
 
 void take_one_lock(const std::string& identifier, bool forWriting) {
   const std::size_t hash = KSTIdentifierLockTable::hashOf(identifier);
-  std::unique_lock lock = lockStateMutex();
+  std::unique_lock lock(gKSTLocks.mutex);
   if (forWriting) {
     waitUntil(lock, gKSTLocks.identifierWritersCondition,
               [] { return gKSTLocks.allReaderWriterState == 0; });
@@ -350,7 +385,7 @@ void take_one_lock(const std::string& identifier, bool forWriting) {
 
 void unlock_one_lock(const std::string& identifier) {
   const std::size_t hash = KSTIdentifierLockTable::hashOf(identifier);
-  std::unique_lock lock = lockStateMutex();
+  std::unique_lock lock(gKSTLocks.mutex);
   KSTIdentifierLockTable& map = gKSTLocks.identifierToLockMap;
   KSTIdentifierLock* found = map.find(identifier, hash);
   // An idle record is one nobody holds.
@@ -456,7 +491,7 @@ void unlock_identifier(const std::vector<std::string>& identifiers) {
 
 void _lock_all_identifiers(bool forWriting) {
   KSTLog(kLogDebug, "Waiting to lock all identifiers for %s", modeName(forWriting));
-  std::unique_lock lock = lockStateMutex();
+  std::unique_lock lock(gKSTLocks.mutex);
   if (forWriting) {
     waitUntil(lock, gKSTLocks.allWritersCondition, [] {
       return gKSTLocks.identifierReaderCount == 0 && gKSTLocks.identifierWriterCount == 0 &&
@@ -474,7 +509,7 @@ void _lock_all_identifiers(bool forWriting) {
 
 void unlock_all_identifiers() {
   {
-    std::unique_lock lock = lockStateMutex();
+    std::unique_lock lock(gKSTLocks.mutex);
     if (gKSTLocks.allReaderWriterState == -1) {
       gKSTLocks.allReaderWriterState = 0;
       gKSTLocks.allWritersCondition.notify_one();
