@@ -413,8 +413,8 @@ void unlock_one_lock(const std::string& identifier) {
     if (readersLeft == 0) record.waiters.notify_all();
     KST_INVARIANT(gKSTLocks.allReaderWriterState >= 0);
     KST_INVARIANT(gKSTLocks.identifierReaderCount > 0);
-    --gKSTLocks.identifierReaderCount;
-    if (gKSTLocks.allReaderWriterState == 0 && gKSTLocks.identifierReaderCount == 0 &&
+    const std::uint32_t identifierReaders = --gKSTLocks.identifierReaderCount;
+    if (gKSTLocks.allReaderWriterState == 0 && identifierReaders == 0 &&
         gKSTLocks.identifierWriterCount == 0) {
       gKSTLocks.allWritersCondition.notify_one();
     }
