@@ -41,8 +41,8 @@ import json, sys
 PAIRS = [
     ("BM_IdentifierLockWriting", "BM_SharedMutexWriting"),
     ("BM_IdentifierLockReading", "BM_SharedMutexReading"),
-    ("BM_IdentifierLockWriting", "BM_DesignFloorWriting"),
-    ("BM_IdentifierLockReading", "BM_DesignFloorReading"),
+    ("BM_IdentifierLockWriting", "BM_DesignFloor"),
+    ("BM_IdentifierLockReading", "BM_DesignFloor"),
     ("BM_CacheLookup", "BM_PlainLstat"),
     ("BM_CacheRebuild", "BM_PlainReadMetadataFiles"),
     ("BM_ProtectionChange", "BM_BareXattrWalk"),

@@ -1,12 +1,10 @@
 #include "daemon/locks.h"
 
-#include <pthread.h>
-
 #include <algorithm>
 #include <atomic>
 #include <bit>
-#include <cerrno>
 #include <chrono>
+#include <climits>
 #include <condition_variable>
 #include <cstdint>
 #include <cstring>
@@ -26,51 +24,109 @@ namespace kestrel {
 
 namespace {
 
-// Owns one pthread reader/writer lock with default attributes.
-class ReaderWriterLock {
- public:
-  ReaderWriterLock() {
-    const int status = pthread_rwlock_init(&lock_, nullptr);
-    KST_INVARIANT(status == 0);
-  }
-  ~ReaderWriterLock() { pthread_rwlock_destroy(&lock_); }
-  ReaderWriterLock(const ReaderWriterLock&) = delete;
-  ReaderWriterLock& operator=(const ReaderWriterLock&) = delete;
+// Every lock here is held for a short while by requests that run on other
+// cores, and a thread put to sleep on this virtual machine takes tens of
+// microseconds to wake: so a locker that finds a lock taken tries again for a
+// few microseconds before it sleeps.
+constexpr auto kSpinBeforeSleeping = std::chrono::microseconds(20);
 
-  void lockForWriting() {
-    const int status = pthread_rwlock_wrlock(&lock_);
-    KST_INVARIANT(status == 0);
+void cpuRelax() {
+#if defined(__x86_64__) || defined(__i386__)
+  __builtin_ia32_pause();
+#else
+  std::this_thread::yield();
+#endif
+}
+
+// Calls `attempt` until it succeeds or the spin time is over.
+template <typename Attempt>
+bool spinFor(Attempt attempt) {
+  if (attempt()) return true;
+  const auto deadline = std::chrono::steady_clock::now() + kSpinBeforeSleeping;
+  do {
+    for (int i = 0; i < 32; ++i) cpuRelax();
+    if (attempt()) return true;
+  } while (std::chrono::steady_clock::now() < deadline);
+  return false;
+}
+
+// The mutex of the lock state. Free, it is taken and released with one atomic
+// instruction each, inline; a locker that finds it held spins for a while,
+// then sleeps on its word.
+class KSTStateMutex {
+ public:
+  void lock() {
+    if (!try_lock()) [[unlikely]] {
+      lockContended();
+    }
   }
-  void lockForReading() {
-    const int status = pthread_rwlock_rdlock(&lock_);
-    KST_INVARIANT(status == 0);
+  bool try_lock() {
+    std::uint32_t expected = kFree;
+    return word_.compare_exchange_strong(expected, kHeld, std::memory_order_acquire,
+                                         std::memory_order_relaxed);
   }
-  bool tryLockForWriting() { return tryStatus(pthread_rwlock_trywrlock(&lock_)); }
-  bool tryLockForReading() { return tryStatus(pthread_rwlock_tryrdlock(&lock_)); }
+  // Sequentially consistent, as is the sleeper's registering itself before it
+  // sleeps: notify_one wakes nobody when it sees no sleeper registered.
   void unlock() {
-    const int status = pthread_rwlock_unlock(&lock_);
-    KST_INVARIANT(status == 0);
+    if (word_.exchange(kFree) == kHeldWithSleepers) [[unlikely]] {
+      word_.notify_one();
+    }
   }
 
  private:
-  static bool tryStatus(int status) {
-    KST_INVARIANT(status == 0 || status == EBUSY || status == EAGAIN);
-    return status == 0;
+  static constexpr std::uint32_t kFree = 0;
+  static constexpr std::uint32_t kHeld = 1;
+  // Held, and a locker may sleep on the word: its release wakes one.
+  static constexpr std::uint32_t kHeldWithSleepers = 2;
+
+  [[gnu::noinline]] void lockContended() {
+    if (spinFor([this] { return word_.load(std::memory_order_relaxed) == kFree && try_lock(); })) {
+      return;
+    }
+    while (word_.exchange(kHeldWithSleepers, std::memory_order_acquire) != kFree) {
+      word_.wait(kHeldWithSleepers);
+    }
   }
-  pthread_rwlock_t lock_;
+
+  std::atomic<std::uint32_t> word_{kFree};
+};
+
+// A condition variable that counts its sleepers (under gKSTLocks.mutex), so
+// that signalling nobody costs nothing.
+struct KSTLockCondition {
+  std::condition_variable_any variable;
+  std::uint32_t sleepers = 0;
+
+  void notify_one() {
+    if (sleepers != 0) variable.notify_one();
+  }
+  void notify_all() {
+    if (sleepers != 0) variable.notify_all();
+  }
 };
 
 // One identifier that is locked or waited for. Made when the first locker
 // arrives; when the last one releases it, it stays in the table, idle, for the
 // identifier's next locker (up to a bound), so that the lock and unlock of an
 // identifier nobody else holds allocate and copy nothing.
+//
+// The record's lock state is its reader/writer lock: it is changed only with
+// gKSTLocks.mutex held, so a locker that finds the identifier free takes it in
+// the same pass that finds the record, and one that cannot sleeps on `waiters`.
+// Readers are let in whenever no writer holds the identifier, also while a
+// writer waits.
 struct KSTIdentifierLock {
-  ReaderWriterLock lock;
+  // 0 free, -1 held by a writer, n > 0 held by n readers. Written only with
+  // gKSTLocks.mutex held; read without it only by waiters spinning until it
+  // may let them in.
+  std::atomic<std::int32_t> lockState{0};
   // Holders and waiters of this record; guarded by gKSTLocks.mutex.
   std::uint64_t useCount = 0;
-  // 0 free, -1 held by a writer, n > 0 held by n readers. Changed only by atomic
-  // operations with full barriers, by the holders of `lock`.
-  std::atomic<std::int32_t> lockState{0};
+  // The thread holding the identifier for writing (guarded by gKSTLocks.mutex):
+  // a thread that locks it again would wait for itself forever, so it aborts.
+  std::thread::id writer;
+  // Lockers waiting for lockState to let them in.
+  KSTLockCondition waiters;
   // The table's part, guarded by gKSTLocks.mutex: the key, its hash and the
   // next record of the same bucket.
   std::string identifier;
@@ -194,25 +250,11 @@ class KSTIdentifierLockTable {
   std::size_t idle_ = 0;
 };
 
-// A condition variable that counts its sleepers (under gKSTLocks.mutex), so
-// that signalling nobody costs nothing.
-struct KSTLockCondition {
-  std::condition_variable variable;
-  std::uint32_t sleepers = 0;
-
-  void notify_one() {
-    if (sleepers != 0) variable.notify_one();
-  }
-  void notify_all() {
-    if (sleepers != 0) variable.notify_all();
-  }
-};
-
 // The process-wide lock state. `mutex` guards every other field and the table.
-// It is always taken alone: a record's lock is awaited only after `mutex` has
-// been released, and released while `mutex` is held.
+// It is always taken alone, and never held while waiting: waiters sleep on a
+// condition, which releases it.
 struct KSTLocksState {
-  std::mutex mutex;
+  KSTStateMutex mutex;
   KSTLockCondition allWritersCondition;
   KSTLockCondition allReadersCondition;
   KSTLockCondition identifierWritersCondition;
@@ -229,46 +271,14 @@ struct KSTLocksState {
 
 KSTLocksState gKSTLocks;
 
-// Every lock here is held for a short while by requests that run on other
-// cores, and a thread put to sleep on this virtual machine takes tens of
-// microseconds to wake: so a locker that finds a lock taken tries again for a
-// few microseconds before it sleeps.
-constexpr auto kSpinBeforeSleeping = std::chrono::microseconds(20);
-
-void cpuRelax() {
-#if defined(__x86_64__) || defined(__i386__)
-  __builtin_ia32_pause();
-#else
-  std::this_thread::yield();
-#endif
-}
-
-// Calls `attempt` until it succeeds or the spin time is over.
-template <typename Attempt>
-bool spinFor(Attempt attempt) {
-  if (attempt()) return true;
-  const auto deadline = std::chrono::steady_clock::now() + kSpinBeforeSleeping;
-  do {
-    for (int i = 0; i < 32; ++i) cpuRelax();
-    if (attempt()) return true;
-  } while (std::chrono::steady_clock::now() < deadline);
-  return false;
-}
-
-std::unique_lock<std::mutex> lockStateMutex() {
-  std::unique_lock lock(gKSTLocks.mutex, std::defer_lock);
-  if (!spinFor([&] { return lock.try_lock(); })) lock.lock();
-  return lock;
-}
-
-// Returns with `lock` held and `ready()` true: tries for a while with the
-// mutex released between tries, then sleeps on the condition.
-template <typename Ready>
-void waitUntil(std::unique_lock<std::mutex>& lock, KSTLockCondition& condition, Ready ready) {
-  if (ready()) return;
-  lock.unlock();
+// Called with `lock` released, returns with it held and `ready()` true: tries
+// for a while, then sleeps on the condition. `mayBeReady`, called without the
+// mutex, spares the mutex the tries that cannot succeed.
+template <typename Ready, typename MayBeReady>
+void lockWhen(std::unique_lock<KSTStateMutex>& lock, KSTLockCondition& condition, Ready ready,
+              MayBeReady mayBeReady) {
   spinFor([&] {
-    if (!lock.try_lock()) return false;
+    if (!mayBeReady() || !lock.try_lock()) return false;
     if (ready()) return true;
     lock.unlock();
     return false;
@@ -277,6 +287,14 @@ void waitUntil(std::unique_lock<std::mutex>& lock, KSTLockCondition& condition, 
   ++condition.sleepers;
   condition.variable.wait(lock, ready);
   --condition.sleepers;
+}
+
+// Returns with `lock` still held and `ready()` true.
+template <typename Ready>
+void waitUntil(std::unique_lock<KSTStateMutex>& lock, KSTLockCondition& condition, Ready ready) {
+  if (ready()) return;
+  lock.unlock();
+  lockWhen(lock, condition, ready, [] { return true; });
 }
 
 const char* modeName(bool forWriting) {
@@ -316,39 +334,58 @@ std::vector<std::string> sortedIdentifiers(const PlistArray& identifiers, bool a
   return result;
 }
 
+// Takes the record's lock once its state lets the locker in (under gKSTLocks.mutex).
+void enter(KSTIdentifierLock& record, bool forWriting) {
+  if (forWriting) {
+    record.lockState.store(-1, std::memory_order_relaxed);
+    record.writer = std::this_thread::get_id();
+    return;
+  }
+  const std::int32_t readers = record.lockState.load(std::memory_order_relaxed);
+  KST_INVARIANT(readers < INT32_MAX);
+  record.lockState.store(readers + 1, std::memory_order_relaxed);
+}
+
 void take_one_lock(const std::string& identifier, bool forWriting) {
   const std::size_t hash = KSTIdentifierLockTable::hashOf(identifier);
-  KSTIdentifierLock* record = nullptr;
-  {
-    std::unique_lock lock = lockStateMutex();
-    if (forWriting) {
-      waitUntil(lock, gKSTLocks.identifierWritersCondition,
-                [] { return gKSTLocks.allReaderWriterState == 0; });
-      ++gKSTLocks.identifierWriterCount;
-    } else {
-      waitUntil(lock, gKSTLocks.identifierReadersCondition,
-                [] { return gKSTLocks.allReaderWriterState != -1; });
-      ++gKSTLocks.identifierReaderCount;
-    }
-    record = &gKSTLocks.identifierToLockMap.acquire(identifier, hash);
-    ++record->useCount;
+  std::unique_lock lock(gKSTLocks.mutex);
+  if (forWriting) {
+    waitUntil(lock, gKSTLocks.identifierWritersCondition,
+              [] { return gKSTLocks.allReaderWriterState == 0; });
+    ++gKSTLocks.identifierWriterCount;
+  } else {
+    waitUntil(lock, gKSTLocks.identifierReadersCondition,
+              [] { return gKSTLocks.allReaderWriterState != -1; });
+    ++gKSTLocks.identifierReaderCount;
   }
+  KSTIdentifierLock& record = gKSTLocks.identifierToLockMap.acquire(identifier, hash);
+  ++record.useCount;
+  // The counts above stay raised while this locker waits for the record, so
+  // the lock on all identifiers cannot be taken in between.
+  const auto mayEnter = [&record, forWriting] {
+    const std::int32_t state = record.lockState.load(std::memory_order_relaxed);
+    return forWriting ? state == 0 : state != -1;
+  };
+  const bool entered = mayEnter();
+  if (entered) {
+    enter(record, forWriting);
+  } else {
+    KST_INVARIANT(record.writer != std::this_thread::get_id());
+  }
+  lock.unlock();
 
   KSTLog(kLogDebug, "Waiting to lock %@ for %s", identifier, modeName(forWriting));
-  if (forWriting) {
-    if (!spinFor([&] { return record->lock.tryLockForWriting(); })) record->lock.lockForWriting();
-    std::int32_t expected = 0;
-    KST_INVARIANT(record->lockState.compare_exchange_strong(expected, -1));
-  } else {
-    if (!spinFor([&] { return record->lock.tryLockForReading(); })) record->lock.lockForReading();
-    KST_INVARIANT(record->lockState.fetch_add(1) + 1 > 0);
+  if (!entered) {
+    lockWhen(lock, record.waiters, mayEnter, mayEnter);
+    enter(record, forWriting);
+    lock.unlock();
   }
   KSTLog(kLogDebug, "Got lock on identifier %@", identifier);
 }
 
 void unlock_one_lock(const std::string& identifier) {
   const std::size_t hash = KSTIdentifierLockTable::hashOf(identifier);
-  std::unique_lock lock = lockStateMutex();
+  std::unique_lock lock(gKSTLocks.mutex);
   KSTIdentifierLockTable& map = gKSTLocks.identifierToLockMap;
   KSTIdentifierLock* found = map.find(identifier, hash);
   // An idle record is one nobody holds.
@@ -357,8 +394,9 @@ void unlock_one_lock(const std::string& identifier) {
   KST_INVARIANT(record.lockState.load() != 0);
 
   if (record.lockState.load() == -1) {
-    std::int32_t expected = -1;
-    KST_INVARIANT(record.lockState.compare_exchange_strong(expected, 0));
+    record.lockState.store(0, std::memory_order_relaxed);
+    record.writer = std::thread::id();
+    record.waiters.notify_all();
     KST_INVARIANT(gKSTLocks.allReaderWriterState == 0);
     KST_INVARIANT(gKSTLocks.identifierWriterCount > 0);
     const std::uint32_t writersBefore = gKSTLocks.identifierWriterCount--;
@@ -369,11 +407,14 @@ void unlock_one_lock(const std::string& identifier) {
       gKSTLocks.allReadersCondition.notify_all();
     }
   } else {
-    KST_INVARIANT(record.lockState.fetch_sub(1) - 1 >= 0);
+    const std::int32_t readersLeft = record.lockState.load() - 1;
+    KST_INVARIANT(readersLeft >= 0);
+    record.lockState.store(readersLeft, std::memory_order_relaxed);
+    if (readersLeft == 0) record.waiters.notify_all();
     KST_INVARIANT(gKSTLocks.allReaderWriterState >= 0);
     KST_INVARIANT(gKSTLocks.identifierReaderCount > 0);
-    --gKSTLocks.identifierReaderCount;
-    if (gKSTLocks.allReaderWriterState == 0 && gKSTLocks.identifierReaderCount == 0 &&
+    const std::uint32_t identifierReaders = --gKSTLocks.identifierReaderCount;
+    if (gKSTLocks.allReaderWriterState == 0 && identifierReaders == 0 &&
         gKSTLocks.identifierWriterCount == 0) {
       gKSTLocks.allWritersCondition.notify_one();
     }
@@ -381,7 +422,6 @@ void unlock_one_lock(const std::string& identifier) {
 
   KST_INVARIANT(record.useCount > 0);
   --record.useCount;
-  record.lock.unlock();
   KSTLog(kLogDebug, "Unlocked identifier %@", identifier);
 
   if (record.useCount == 0) {
@@ -451,7 +491,7 @@ void unlock_identifier(const std::vector<std::string>& identifiers) {
 
 void _lock_all_identifiers(bool forWriting) {
   KSTLog(kLogDebug, "Waiting to lock all identifiers for %s", modeName(forWriting));
-  std::unique_lock lock = lockStateMutex();
+  std::unique_lock lock(gKSTLocks.mutex);
   if (forWriting) {
     waitUntil(lock, gKSTLocks.allWritersCondition, [] {
       return gKSTLocks.identifierReaderCount == 0 && gKSTLocks.identifierWriterCount == 0 &&
@@ -469,7 +509,7 @@ void _lock_all_identifiers(bool forWriting) {
 
 void unlock_all_identifiers() {
   {
-    std::unique_lock lock = lockStateMutex();
+    std::unique_lock lock(gKSTLocks.mutex);
     if (gKSTLocks.allReaderWriterState == -1) {
       gKSTLocks.allReaderWriterState = 0;
       gKSTLocks.allWritersCondition.notify_one();

@@ -341,6 +341,12 @@ TEST_F(LocksDeathTest, MisuseAbortsWithTheFailedCondition) {
          unlock_identifier(std::vector<std::string>{"X"});
        },
        "found != nullptr"},
+      {"identifier locked again by its writer",
+       [] {
+         _lock_identifier("X", kKSTLockForWriting);
+         _lock_identifier("X", kKSTLockForReading);
+       },
+       "record.writer != "},
       {"all identifiers not locked", [] { unlock_all_identifiers(); }, "allReaderWriterState > 0"},
       {"number as identifier", [] { _lock_identifier(PlistValue(42), kKSTLockForReading); },
        "Unknown parameter type!"},
