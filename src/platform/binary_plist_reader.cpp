@@ -12,12 +12,6 @@ namespace kestrel::platform {
 
 namespace {
 
-template <typename T>
-std::optional<T> fail(std::string* error, std::string reason) {
-  if (error != nullptr) *error = std::move(reason);
-  return std::nullopt;
-}
-
 // Appends the UTF-8 form of `length` UTF-16 big-endian code units; false when
 // they hold a lone surrogate.
 bool appendUtf8OfUtf16(const std::uint8_t* units, std::uint64_t length, std::string& out) {
@@ -72,6 +66,10 @@ class BinaryPropertyListReader {
   bool failWith(std::string* error, const char* reason) {
     if (error != nullptr) *error = reason;
     return false;
+  }
+  std::nullopt_t failValue(std::string* error, const char* reason) {
+    failWith(error, reason);
+    return std::nullopt;
   }
 
   bool readTrailer(std::string* error) {
@@ -167,6 +165,19 @@ class BinaryPropertyListReader {
     return true;
   }
 
+  // The contents of a string or data object: *length characters of `unit`
+  // bytes each from *start, all before the offset table.
+  bool readRun(std::uint64_t offset, std::uint64_t unit, const std::uint8_t** start,
+               std::uint64_t* length, std::string* error) {
+    std::uint64_t begin = 0;
+    if (!readCount(offset, length, &begin, error)) return false;
+    if (*length > (objectsEnd_ - begin) / unit) {
+      return failWith(error, "binary property list is truncated");
+    }
+    *start = bytes_.data() + begin;
+    return true;
+  }
+
   std::uint64_t refAt(const Object& object, std::uint64_t index) const {
     return bplist::readBigEndian(bytes_.data() + object.refsStart + index * refSize_, refSize_);
   }
@@ -259,15 +270,11 @@ class BinaryPropertyListReader {
     if (kind != bplist::kKindAsciiString && kind != bplist::kKindUnicodeString) {
       return failWith(error, "property list dictionary key is not a string");
     }
+    const std::uint8_t* characters = nullptr;
     std::uint64_t length = 0;
-    std::uint64_t start = 0;
-    if (!readCount(offset, &length, &start, error)) return false;
-    const std::uint64_t unit = kind == bplist::kKindAsciiString ? 1 : 2;
-    if (length > (objectsEnd_ - start) / unit) {
-      return failWith(error, "binary property list is truncated");
-    }
-    const std::uint8_t* characters = bytes_.data() + start;
-    if (unit == 1) {
+    const bool ascii = kind == bplist::kKindAsciiString;
+    if (!readRun(offset, ascii ? 1 : 2, &characters, &length, error)) return false;
+    if (ascii) {
       out->assign(reinterpret_cast<const char*>(characters), length);
     } else {
       out->clear();
@@ -294,8 +301,7 @@ class BinaryPropertyListReader {
         return integerAt(offset, info);  // its size and range were checked with the graph
       case bplist::kKindReal: {
         const std::uint8_t* p = info == 2 || info == 3 ? payload(offset, 1u << info) : nullptr;
-        if (p == nullptr)
-          return fail<PlistValue>(error, "binary property list has an invalid real");
+        if (p == nullptr) return failValue(error, "binary property list has an invalid real");
         if (info == 2) {
           return PlistValue(double{
               std::bit_cast<float>(static_cast<std::uint32_t>(bplist::readBigEndian(p, 4)))});
@@ -304,18 +310,13 @@ class BinaryPropertyListReader {
       }
       case bplist::kKindDate: {
         const std::uint8_t* p = marker == bplist::kMarkerDate ? payload(offset, 8) : nullptr;
-        if (p == nullptr)
-          return fail<PlistValue>(error, "binary property list has an invalid date");
+        if (p == nullptr) return failValue(error, "binary property list has an invalid date");
         return PlistValue(PlistDate{std::bit_cast<double>(bplist::readBigEndian(p, 8))});
       }
       case bplist::kKindData: {
+        const std::uint8_t* bytes = nullptr;
         std::uint64_t length = 0;
-        std::uint64_t start = 0;
-        if (!readCount(offset, &length, &start, error)) return std::nullopt;
-        if (length > objectsEnd_ - start) {
-          return fail<PlistValue>(error, "binary property list is truncated");
-        }
-        const std::uint8_t* bytes = bytes_.data() + start;
+        if (!readRun(offset, 1, &bytes, &length, error)) return std::nullopt;
         return PlistValue(PlistData(bytes, bytes + length));
       }
       case bplist::kKindAsciiString:
@@ -325,7 +326,7 @@ class BinaryPropertyListReader {
         return PlistValue(std::move(text));
       }
       case bplist::kKindUid:
-        return fail<PlistValue>(error, "property list holds a UID object, which is not supported");
+        return failValue(error, "property list holds a UID object, which is not supported");
       case bplist::kKindArray:
       case bplist::kKindOrderedSet:
       case bplist::kKindSet:
@@ -335,7 +336,7 @@ class BinaryPropertyListReader {
       default:
         break;
     }
-    return fail<PlistValue>(error, "property list holds an object of an unsupported type");
+    return failValue(error, "property list holds an object of an unsupported type");
   }
 
   // One, two and four-byte integers are unsigned; eight bytes hold a signed
