@@ -4,6 +4,8 @@
 
 #include <algorithm>
 
+#include "platform/hex.h"
+
 namespace kestrel::platform {
 
 Uuid Uuid::random() {
@@ -12,37 +14,23 @@ Uuid Uuid::random() {
   return Uuid(bytes);
 }
 
-namespace {
-
-// The value of a hexadecimal digit of either case, or -1.
-int hexValue(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
-}
-
-}  // namespace
-
 // The canonical form only: 8-4-4-4-12 hexadecimal digits of either case. Read
 // here rather than by the library, which wants a terminated copy and costs a
 // visible share of a cache rebuild (one UUID per container).
 std::optional<Uuid> Uuid::parse(std::string_view text) {
   constexpr std::size_t kLength = 36;
+  constexpr std::size_t kGroupBytes[] = {4, 2, 2, 2, 6};
   if (text.size() != kLength) return std::nullopt;
   Bytes bytes;
-  std::size_t out = 0;
-  for (std::size_t i = 0; i < kLength;) {
-    if (i == 8 || i == 13 || i == 18 || i == 23) {
-      if (text[i] != '-') return std::nullopt;
-      ++i;
-      continue;
+  std::span<std::uint8_t> out(bytes);
+  for (const std::size_t groupBytes : kGroupBytes) {
+    if (!decodeHex(text.substr(0, groupBytes * 2), out.first(groupBytes))) return std::nullopt;
+    text.remove_prefix(groupBytes * 2);
+    out = out.subspan(groupBytes);
+    if (!out.empty()) {
+      if (text.front() != '-') return std::nullopt;
+      text.remove_prefix(1);
     }
-    const int high = hexValue(text[i]);
-    const int low = hexValue(text[i + 1]);
-    if (high < 0 || low < 0) return std::nullopt;
-    bytes[out++] = static_cast<std::uint8_t>((high << 4) | low);
-    i += 2;
   }
   return Uuid(bytes);
 }

@@ -4,6 +4,7 @@
 #include <charconv>
 #include <nlohmann/json.hpp>
 
+#include "platform/hex.h"
 #include "platform/uuid.h"
 
 namespace kestrel::kestrelctl {
@@ -28,23 +29,10 @@ std::optional<bool> parseBool(std::string_view text) {
   return std::nullopt;
 }
 
-int hexDigit(char c) {
-  if (c >= '0' && c <= '9') return c - '0';
-  if (c >= 'a' && c <= 'f') return c - 'a' + 10;
-  if (c >= 'A' && c <= 'F') return c - 'A' + 10;
-  return -1;
-}
-
 std::optional<platform::MessageData> parseHex(std::string_view text) {
   if (text.size() % 2 != 0) return std::nullopt;
-  platform::MessageData out;
-  out.reserve(text.size() / 2);
-  for (std::size_t i = 0; i < text.size(); i += 2) {
-    const int high = hexDigit(text[i]);
-    const int low = hexDigit(text[i + 1]);
-    if (high < 0 || low < 0) return std::nullopt;
-    out.push_back(static_cast<std::uint8_t>(high * 16 + low));
-  }
+  platform::MessageData out(text.size() / 2);
+  if (!platform::decodeHex(text, out)) return std::nullopt;
   return out;
 }
 
