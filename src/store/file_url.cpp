@@ -15,11 +15,17 @@ KSTFileURL KSTFileURL::appending(std::string_view component, bool isDirectory) c
   return KSTFileURL(path_ + "/" + std::string(component), isDirectory);
 }
 
+std::string_view KSTFileURL::parentPath(std::string_view path) {
+  const auto slash = path.rfind('/');
+  if (slash == std::string_view::npos) return ".";
+  if (slash == 0) return "/";
+  path = path.substr(0, slash);
+  while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
+  return path;
+}
+
 KSTFileURL KSTFileURL::deletingLastPathComponent() const {
-  const auto slash = path_.rfind('/');
-  if (slash == std::string::npos) return KSTFileURL(".", true);
-  if (slash == 0) return KSTFileURL("/", true);
-  return KSTFileURL(path_.substr(0, slash), true);
+  return KSTFileURL(std::string(parentPath(path_)), true);
 }
 
 std::string KSTFileURL::lastPathComponent() const {

@@ -20,6 +20,8 @@ class KSTFileURL {
 
   KSTFileURL appending(std::string_view component, bool isDirectory = false) const;
   KSTFileURL deletingLastPathComponent() const;
+  // The path deletingLastPathComponent gives, without building a URL.
+  static std::string_view parentPath(std::string_view path);
   std::string lastPathComponent() const;
 
   std::string description() const { return path_; }

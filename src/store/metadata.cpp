@@ -33,22 +33,12 @@ bool personaIsUser(const PlistValue& persona, std::uint32_t userId) {
   return value && *value == userId;
 }
 
-// The path KSTFileURL::deletingLastPathComponent gives, without building it:
-// a cache rebuild asks this three times for every container.
-std::string_view parentPath(std::string_view path) {
-  const auto slash = path.rfind('/');
-  if (slash == std::string_view::npos) return ".";
-  if (slash == 0) return "/";
-  path = path.substr(0, slash);
-  while (path.size() > 1 && path.back() == '/') path.remove_suffix(1);
-  return path;
-}
-
 // Whether the container at `path` sits in the class directory its file names:
 // .../Containers/Data/Application/NAME against .../Containers + the class path.
 bool sitsInItsClassDirectory(std::string_view path, KSTContainerClass containerClass) {
-  const std::string_view found = parentPath(path);
-  const std::string_view base = parentPath(parentPath(found));
+  // Asked for every container of a cache rebuild: no path is built.
+  const std::string_view found = KSTFileURL::parentPath(path);
+  const std::string_view base = KSTFileURL::parentPath(KSTFileURL::parentPath(found));
   std::string_view classPath = KSTContainerClassPath(containerClass);
   while (!classPath.empty() && classPath.front() == '/') classPath.remove_prefix(1);
   while (!classPath.empty() && classPath.back() == '/') classPath.remove_suffix(1);
